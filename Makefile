@@ -1,0 +1,80 @@
+# q7agent: developer and operator entry points.
+#   make deps     install every missing Debian package (apt-get; sudo when not root)
+#   make build    configure and build into build/ (RelWithDebInfo)
+#   make test     deps + build + every test, then the unit tests again under ASan+UBSan
+#   make demo     build, lay out a demo home in demo-home/ and run the agent in the foreground
+#   make bench    Release build of the benchmarks, then run them
+#   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/
+#   make asan / make tsan   sanitizer builds with their unit tests
+
+SHELL := /bin/bash
+BUILD_TYPE ?= RelWithDebInfo
+PREFIX ?= /opt/q7agent
+JOBS ?= $(shell nproc)
+CMAKE_GEN := -G Ninja
+
+DEPS := cmake ninja-build g++ make pkg-config git curl \
+        libgtest-dev libgmock-dev googletest libbenchmark-dev \
+        libssl-dev zlib1g-dev libbrotli-dev libicu-dev icu-devtools \
+        libcpp-httplib-dev nlohmann-json3-dev libspdlog-dev libfmt-dev \
+        libcli11-dev libinih-dev clang libclang-rt-14-dev
+
+SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
+
+.PHONY: all deps build test demo bench install asan tsan clean format
+
+all: build
+
+deps:
+	@missing=""; \
+	for p in $(DEPS); do \
+	  dpkg-query -W -f='$${Status}\n' $$p 2>/dev/null | grep -q '^install ok installed' || missing="$$missing $$p"; \
+	done; \
+	if [ -n "$$missing" ]; then \
+	  echo "Installing missing packages:$$missing"; \
+	  $(SUDO) env DEBIAN_FRONTEND=noninteractive apt-get update -qq && \
+	  $(SUDO) env DEBIAN_FRONTEND=noninteractive apt-get install -y -qq --no-install-recommends $$missing; \
+	fi
+
+build/build.ninja:
+	cmake -S . -B build $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=$(BUILD_TYPE)
+
+build: deps build/build.ninja
+	cmake --build build -j $(JOBS)
+
+test: build
+	cd build && ctest --output-on-failure -j $(JOBS) --timeout 300
+	$(MAKE) --no-print-directory asan
+
+asan: deps
+	cmake -S . -B build-asan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_SANITIZE=ON
+	cmake --build build-asan -j $(JOBS)
+	cd build-asan && ctest --output-on-failure -j $(JOBS) -L unit --timeout 300
+
+tsan: deps
+	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON
+	cmake --build build-tsan -j $(JOBS)
+	cd build-tsan && ctest --output-on-failure -j $(JOBS) -L unit --timeout 300
+
+bench: deps
+	cmake -S . -B build-release $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Release -DQ7_BUILD_TESTS=OFF
+	cmake --build build-release -j $(JOBS)
+	@for b in build-release/bin/bench_*; do [ -x "$$b" ] && "$$b"; done; true
+
+install: build
+	cmake --install build --prefix "$(PREFIX)"
+	PREFIX="$(PREFIX)" resources/install-home.sh
+
+DEMO_HOME := $(CURDIR)/demo-home
+demo: build
+	@$(MAKE) --no-print-directory install PREFIX="$(DEMO_HOME)" >/dev/null
+	@echo "q7agent demo: home $(DEMO_HOME)/, API on http://127.0.0.1:7420 (Ctrl-C stops it)"
+	@echo "  try: curl -s http://127.0.0.1:7420/healthz ; curl -s http://127.0.0.1:7420/api/v1/agent"
+	Q7_HOME="$(DEMO_HOME)/" Q7_TRACE_FILE=- Q7_TRACE="$${Q7_TRACE:-*=ERROR|SUMMARY}" \
+	  DPX_NOSTART=1 "$(DEMO_HOME)/bin/q7agent"
+
+format:
+	clang-format -i $$(git ls-files '*.h' '*.cc')
+
+clean:
+	rm -rf build build-asan build-tsan build-release

@@ -1,0 +1,2 @@
+// Process entry; filled in by the start-up code.
+int main() { return 0; }
