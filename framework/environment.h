@@ -17,17 +17,20 @@ namespace fw {
 // The folder holding the running executable, with a trailing '/'.
 std::string ExecutableDirectory();
 
-// Home directory: Q7_HOME (a '/' appended when missing) or the parent of the executable's
-// folder. Returns kOk, or kNotFound when neither can be determined.
+// Home directory: Q7_HOME of the process environment (a '/' appended when missing) or the
+// parent of the executable's folder. Returns kOk, or kNotFound when neither can be determined.
 int GetHomeDirectory(std::string* out);
 
-// Configuration directory: Q7_CONFIG_DIR (a '/' appended when missing) or <home>config/.
+// Configuration directory: Q7_CONFIG_DIR of the process environment (a '/' appended when
+// missing) or <home>config/. Neither directory variable is read from q7.env, which lives here.
 int GetConfigDirectory(std::string* out);
 
-// Environment lookup: the process environment first, then NAME=VALUE lines of
-// <configdir>q7.env ('#' starts a comment line; blanks around the name are dropped; a value in
-// matching double quotes loses them). KQ7_CLASSPATH set by neither answers the lib/ folder
-// beside the executable's folder. Returns true and the value when found.
+// Environment lookup: the process environment first (a variable set to "" counts), then
+// NAME=VALUE lines of <configdir>q7.env ('#' at the start of a line makes a comment line;
+// blanks around the name and the value are dropped; a value in matching double quotes loses
+// them; a name defined twice takes its last value; other lines are skipped). KQ7_CLASSPATH set
+// by neither answers the lib folder beside the executable's folder ("/opt/q7/lib" for
+// "/opt/q7/bin/q7agent", no trailing '/'). Returns true and the value when found.
 bool GetEnv(const char* name, std::string* value);
 
 }  // namespace fw

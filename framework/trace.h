@@ -30,8 +30,10 @@ inline constexpr unsigned kTraceError = 0x80;
 inline constexpr unsigned kTraceAll = 0xFF;
 
 // Parses a Q7_TRACE text and replaces all masks with it (units not named take the "*" mask, or
-// the error class when "*" is not named). On a syntax error returns kParseError, sets *error to
-// a message naming the bad word (when error is non-null) and keeps the previous masks.
+// the error class when "*" is not named). A "*" word overrides the units named before it. Class
+// names are matched in any case; a number above 0xFF is a syntax error. On a syntax error returns
+// kParseError, sets *error to a message naming the bad word (when error is non-null) and keeps the
+// previous masks.
 int TraceConfigure(std::string_view spec, std::string* error);
 
 // Directs records to "path": "-" means standard error, anything else a file rotated at
@@ -46,6 +48,9 @@ void TraceClose();
 // Flushes buffered records to the destination.
 void TraceFlush();
 
+// The masks in force as Q7_TRACE text ("*=0x80 tama=0xFF"); TraceConfigure of it restores them.
+std::string TraceMasksText();
+
 // The mask in force for a unit.
 unsigned TraceMask(std::string_view unit);
 
@@ -53,9 +58,10 @@ unsigned TraceMask(std::string_view unit);
 bool TraceEnabled(std::string_view unit, unsigned cls);
 
 // Writes one record unconditionally. cls names the record's class (the highest bit set wins
-// for the label). func may be empty.
-void TraceWrite(std::string_view unit, unsigned cls, std::string_view func,
-                std::string_view text);
+// for the label; bits without a class name show in hex, "0x20"). func may be empty, and then
+// the record has no "func: " part. Line ends at the end of text are dropped. Error-class
+// records are flushed at once.
+void TraceWrite(std::string_view unit, unsigned cls, std::string_view func, std::string_view text);
 
 // Formats printf-style and writes one record when cls is enabled for the unit. Text longer
 // than 8191 characters is cut.
@@ -63,8 +69,8 @@ void TracePrintf(std::string_view unit, unsigned cls, std::string_view func, con
     __attribute__((format(printf, 4, 5)));
 
 // Formats printf-style and writes one record whatever the masks say.
-void TracePrintfAlways(std::string_view unit, unsigned cls, std::string_view func,
-                       const char* fmt, ...) __attribute__((format(printf, 4, 5)));
+void TracePrintfAlways(std::string_view unit, unsigned cls, std::string_view func, const char* fmt,
+                       ...) __attribute__((format(printf, 4, 5)));
 
 // Writes a function entry or exit event ("ENTER" / "EXIT", with optional text) when the flow
 // class is enabled for the unit.

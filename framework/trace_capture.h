@@ -24,6 +24,9 @@ class TraceCapture {
   // How many records contain text.
   int count(std::string_view text) const;
   void clear();
+
+ private:
+  std::string previous_masks_;  // TraceMasksText() before this capture, restored on destruction
 };
 
 }  // namespace fw

@@ -1,0 +1,77 @@
+#include "framework/clock.h"
+
+#include <atomic>
+#include <cstdio>
+#include <cstring>
+#include <mutex>
+#include <utility>
+
+namespace fw {
+namespace {
+
+std::mutex g_clock_mutex;
+std::function<time_t()> g_clock;  // guarded by g_clock_mutex; empty: time()
+// Lets Now() skip the lock in production, where no clock is ever injected.
+std::atomic<bool> g_clock_injected{false};
+
+}  // namespace
+
+time_t Now() {
+  if (g_clock_injected.load(std::memory_order_acquire)) {
+    std::lock_guard<std::mutex> lock(g_clock_mutex);
+    if (g_clock) {
+      return g_clock();
+    }
+  }
+  return time(nullptr);
+}
+
+void SetClockForTesting(std::function<time_t()> clock) {
+  std::lock_guard<std::mutex> lock(g_clock_mutex);
+  g_clock = std::move(clock);
+  g_clock_injected.store(static_cast<bool>(g_clock), std::memory_order_release);
+}
+
+}  // namespace fw
+
+void TimeSince70ToMordel(time_t t, char* out) {
+  struct tm local;
+  if (localtime_r(&t, &local) == nullptr) {
+    std::memset(out, '0', 16);
+    return;
+  }
+  // Wide enough for any int fields, so an out-of-range year cannot overflow; only 16 are kept.
+  char text[80];
+  snprintf(text, sizeof(text), "%03d%02d%02d%02d%02d%02d000", local.tm_year, local.tm_mon + 1,
+           local.tm_mday, local.tm_hour, local.tm_min, local.tm_sec);
+  std::memcpy(out, text, 16);
+}
+
+time_t MordelToTimeSince70(const char* text) {
+  if (text == nullptr) {
+    return -1;
+  }
+  // Timestamps live in fixed-width fields without a terminator.
+  char field[17];
+  std::size_t len = 0;
+  while (len < 16 && text[len] != '\0') {
+    field[len] = text[len];
+    ++len;
+  }
+  field[len] = '\0';
+  struct tm local;
+  std::memset(&local, 0, sizeof(local));
+  if (sscanf(field, "%3d%2d%2d%2d%2d%2d", &local.tm_year, &local.tm_mon, &local.tm_mday,
+             &local.tm_hour, &local.tm_min, &local.tm_sec) != 6) {
+    return -1;
+  }
+  local.tm_mon -= 1;
+  local.tm_isdst = -1;
+  return mktime(&local);
+}
+
+int64_t QbrmBestGetCurrentTime() {
+  struct timespec ts;
+  clock_gettime(CLOCK_MONOTONIC, &ts);
+  return static_cast<int64_t>(ts.tv_sec) * 1000000000 + ts.tv_nsec;
+}

@@ -1,0 +1,185 @@
+#include "framework/http_server.h"
+
+#include <httplib.h>
+
+#include <cerrno>
+#include <chrono>
+#include <cstring>
+#include <string>
+#include <thread>
+
+#include <nlohmann/json.hpp>
+
+#include "framework/agent_runtime.h"
+#include "framework/runtime_state.h"
+#include "framework/status.h"
+#include "framework/trace.h"
+
+namespace fw {
+namespace {
+
+constexpr char kUnit[] = "http";
+constexpr std::size_t kMaxBodyBytes = 64 * 1024;
+constexpr std::size_t kWorkerThreads = 16;
+
+const auto kProcessStart = std::chrono::steady_clock::now();
+
+void ReplyJson(httplib::Response& res, int status, const nlohmann::json& body) {
+  res.status = status;
+  res.set_content(body.dump(2) + "\n", "application/json");
+}
+
+void ReplyError(httplib::Response& res, int status, const std::string& message) {
+  ReplyJson(res, status, nlohmann::json{{"error", message}});
+}
+
+nlohmann::json AgentInfo() {
+  nlohmann::json info;
+  const auto uptime = std::chrono::duration_cast<std::chrono::seconds>(
+      std::chrono::steady_clock::now() - kProcessStart);
+  info["product"] = "Q7";
+  info["version"] = ProductVersion();
+  info["node_type"] = NodeType();
+  info["host_name"] = HostName();
+  info["origin_node"] = OriginNodeName();
+  info["affinities"] = Affinities();
+  info["uptime_seconds"] = uptime.count();
+  std::function<void(nlohmann::json&)> provider;
+  {
+    std::lock_guard<std::mutex> lock(State().mutex);
+    provider = State().info_provider;
+  }
+  if (provider) {
+    provider(info);
+  }
+  return info;
+}
+
+nlohmann::json Health() {
+  nlohmann::json health{{"status", "ok"}};
+  std::function<void(nlohmann::json&)> provider;
+  {
+    std::lock_guard<std::mutex> lock(State().mutex);
+    provider = State().health_provider;
+  }
+  if (provider) {
+    provider(health);
+  }
+  return health;
+}
+
+}  // namespace
+
+HttpServer::HttpServer() : server_(std::make_unique<httplib::Server>()) {}
+
+HttpServer::~HttpServer() { Stop(); }
+
+bool HttpServer::ParseAddress(const std::string& address, std::string* host, int* port) {
+  const auto colon = address.rfind(':');
+  if (colon == std::string::npos || colon + 1 >= address.size()) {
+    return false;
+  }
+  std::string h = address.substr(0, colon);
+  if (h.size() >= 2 && h.front() == '[' && h.back() == ']') {
+    h = h.substr(1, h.size() - 2);
+  }
+  if (h.empty()) {
+    return false;
+  }
+  const std::string p = address.substr(colon + 1);
+  if (p.size() > 5 || p.find_first_not_of("0123456789") != std::string::npos) {
+    return false;
+  }
+  const int value = std::stoi(p);
+  if (value > 65535) {
+    return false;
+  }
+  *host = h;
+  *port = value;
+  return true;
+}
+
+void HttpServer::InstallRoutes() {
+  httplib::Server& s = *server_;
+  s.new_task_queue = [] { return new httplib::ThreadPool(kWorkerThreads); };
+  s.set_keep_alive_timeout(1);
+  s.set_payload_max_length(kMaxBodyBytes);
+  s.set_error_handler([](const httplib::Request& req, httplib::Response& res) {
+    // cpp-httplib's own replies (404 for unknown paths, 413 for big bodies) are not JSON.
+    if (res.body.empty()) {
+      std::string message = "HTTP status " + std::to_string(res.status);
+      if (res.status == 404) {
+        message = "no such endpoint: " + req.method + " " + req.path;
+      } else if (res.status == 413) {
+        message = "request body larger than 64 KiB";
+      }
+      ReplyError(res, res.status, message);
+    }
+  });
+  s.set_exception_handler(
+      [](const httplib::Request& req, httplib::Response& res, std::exception_ptr ep) {
+        std::string what = "unknown error";
+        try {
+          std::rethrow_exception(ep);
+        } catch (const std::exception& e) {
+          what = e.what();
+        } catch (...) {
+        }
+        Q7_TRACE(kUnit, kTraceError, "%s %s failed: %s", req.method.c_str(), req.path.c_str(),
+                 what.c_str());
+        ReplyError(res, 500, "internal error: " + what);
+      });
+  s.Get("/healthz", [](const httplib::Request&, httplib::Response& res) {
+    ReplyJson(res, 200, Health());
+  });
+  s.Get("/api/v1/agent", [](const httplib::Request&, httplib::Response& res) {
+    ReplyJson(res, 200, AgentInfo());
+  });
+}
+
+int HttpServer::Start(const std::string& address, std::string* error) {
+  if (thread_.joinable()) {
+    *error = "the HTTP server is already running";
+    return kAlreadyRunning;
+  }
+  std::string host;
+  int port = 0;
+  if (!ParseAddress(address, &host, &port)) {
+    *error = "\"" + address + "\" is not an address of the form host:port";
+    return kInvalidArgument;
+  }
+  InstallRoutes();
+  if (port == 0) {
+    port = server_->bind_to_any_port(host.c_str());
+    if (port < 0) {
+      *error = "cannot bind any port on " + host;
+      return kIoError;
+    }
+  } else if (!server_->bind_to_port(host.c_str(), port)) {
+    *error = "cannot bind " + address + ": " + std::strerror(errno);
+    return kIoError;
+  }
+  bound_address_ = (host.find(':') != std::string::npos ? "[" + host + "]" : host) + ":" +
+                   std::to_string(port);
+  thread_ = std::thread([this] {
+    SetThreadName("HTTP Server");
+    server_->listen_after_bind();
+  });
+  // stop() is ignored until the listen loop runs, so a stop right after Start would hang the
+  // join: do not report success before the loop is up.
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+  while (!server_->is_running() && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  }
+  return kOk;
+}
+
+void HttpServer::Stop() {
+  if (!thread_.joinable()) {
+    return;
+  }
+  server_->stop();
+  thread_.join();
+}
+
+}  // namespace fw

@@ -1,0 +1,48 @@
+#pragma once
+
+// The framework's HTTP API server (cpp-httplib): JSON endpoints on one listening address,
+// served from a pool of worker threads.
+//
+// Lifetime: Start once, Stop once (the destructor stops too). Start and Stop run on the main
+// loop's thread; handlers run on the pool's threads and read only thread-safe framework state.
+
+#include <memory>
+#include <string>
+#include <thread>
+
+namespace httplib {
+class Server;
+}
+
+namespace fw {
+
+class HttpServer {
+ public:
+  HttpServer();
+  ~HttpServer();
+  HttpServer(const HttpServer&) = delete;
+  HttpServer& operator=(const HttpServer&) = delete;
+
+  // Listens on "host:port" ("[v6]:port" for IPv6; port 0 picks a free port) and starts
+  // serving on a thread of its own. Returns kOk, kInvalidArgument for an address that does
+  // not parse, or kIoError when the address cannot be bound; *error says why.
+  int Start(const std::string& address, std::string* error);
+
+  // Stops serving and waits for requests in flight. Safe to call when not started.
+  void Stop();
+
+  // "host:port" as bound, empty before Start succeeded.
+  const std::string& bound_address() const { return bound_address_; }
+
+  // Splits "host:port"; returns false when it does not parse.
+  static bool ParseAddress(const std::string& address, std::string* host, int* port);
+
+ private:
+  void InstallRoutes();
+
+  std::unique_ptr<httplib::Server> server_;
+  std::thread thread_;
+  std::string bound_address_;
+};
+
+}  // namespace fw

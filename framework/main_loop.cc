@@ -1,0 +1,96 @@
+// The framework main loop.
+
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <string>
+
+#include "framework/agent_runtime.h"
+#include "framework/environment.h"
+#include "framework/http_server.h"
+#include "framework/runtime_state.h"
+#include "framework/status.h"
+#include "framework/trace.h"
+
+namespace {
+
+constexpr char kUnit[] = "framework";
+constexpr char kDefaultHttpAddress[] = "127.0.0.1:7420";
+
+// Writes the bound address where tests and q7ctl find it; temporary name first, so a reader
+// never sees half a line.
+void WriteAddressFile(const std::string& path, const std::string& address) {
+  const std::string tmp = path + ".tmp";
+  FILE* f = std::fopen(tmp.c_str(), "w");
+  if (f == nullptr) {
+    Q7_TRACE(kUnit, fw::kTraceError, "cannot write %s: %s", tmp.c_str(), std::strerror(errno));
+    return;
+  }
+  std::fprintf(f, "%s\n", address.c_str());
+  const bool ok = std::fclose(f) == 0;
+  if (!ok || std::rename(tmp.c_str(), path.c_str()) != 0) {
+    Q7_TRACE(kUnit, fw::kTraceError, "cannot write %s: %s", path.c_str(), std::strerror(errno));
+    std::remove(tmp.c_str());
+  }
+}
+
+std::string AddressFilePath() {
+  std::string home;
+  if (fw::GetHomeDirectory(&home) != fw::kOk) {
+    return "";
+  }
+  const std::string logs = home + "logs/";
+  ::mkdir(logs.c_str(), 0755);
+  return logs + "q7agent.addr";
+}
+
+}  // namespace
+
+int kunmain(int /*argc*/, char** /*argv*/) {
+  Q7_FLOW(kUnit);
+  fw::AgentLoader loader = nullptr;
+  {
+    std::lock_guard<std::mutex> lock(fw::State().mutex);
+    loader = fw::State().loader;
+  }
+  if (loader != nullptr) {
+    const int rc = loader();
+    Q7_TRACE(kUnit, fw::kTraceDetail, "agent loader returned %d", rc);
+  } else {
+    Q7_TRACE(kUnit, fw::kTraceError, "no agent loader is registered");
+  }
+
+  std::string address;
+  if (!fw::GetEnv("Q7_HTTP_ADDRESS", &address) || address.empty()) {
+    address = kDefaultHttpAddress;
+  }
+  fw::HttpServer server;
+  std::string error;
+  std::string address_file;
+  if (server.Start(address, &error) == fw::kOk) {
+    Q7_TRACE(kUnit, fw::kTraceSummary, "HTTP API listening on %s",
+             server.bound_address().c_str());
+    address_file = AddressFilePath();
+    if (!address_file.empty()) {
+      WriteAddressFile(address_file, server.bound_address());
+    }
+  } else {
+    // The agent still collects and keeps history without its API; say so loudly.
+    fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__,
+                          "HTTP API not started (Q7_HTTP_ADDRESS=%s): %s", address.c_str(),
+                          error.c_str());
+  }
+
+  {
+    std::unique_lock<std::mutex> lock(fw::State().shutdown_mutex);
+    fw::State().shutdown_cv.wait(lock, [] { return fw::State().shutdown_requested; });
+  }
+  Q7_TRACE(kUnit, fw::kTraceSummary, "main loop leaving: stopping the HTTP API");
+  server.Stop();
+  if (!address_file.empty()) {
+    std::remove(address_file.c_str());
+  }
+  return 0;
+}
