@@ -14,7 +14,7 @@ JOBS ?= $(shell nproc)
 CMAKE_GEN := -G Ninja
 
 DEPS := cmake ninja-build g++ make pkg-config git curl \
-        libgtest-dev libgmock-dev googletest libbenchmark-dev \
+        libgtest-dev libgmock-dev libbenchmark-dev \
         libssl-dev zlib1g-dev libbrotli-dev libicu-dev icu-devtools \
         libcpp-httplib-dev nlohmann-json3-dev libspdlog-dev libfmt-dev \
         libcli11-dev libinih-dev clang libclang-rt-14-dev
@@ -70,7 +70,7 @@ demo: build
 	@$(MAKE) --no-print-directory install PREFIX="$(DEMO_HOME)" >/dev/null
 	@echo "q7agent demo: home $(DEMO_HOME)/, API on http://127.0.0.1:7420 (Ctrl-C stops it)"
 	@echo "  try: curl -s http://127.0.0.1:7420/healthz ; curl -s http://127.0.0.1:7420/api/v1/agent"
-	Q7_HOME="$(DEMO_HOME)/" Q7_TRACE_FILE=- Q7_TRACE="$${Q7_TRACE:-*=ERROR|SUMMARY}" \
+	@Q7_HOME="$(DEMO_HOME)/" Q7_TRACE_FILE=- Q7_TRACE="$${Q7_TRACE:-*=ERROR|SUMMARY}" \
 	  DPX_NOSTART=1 "$(DEMO_HOME)/bin/q7agent"
 
 format:

@@ -84,7 +84,9 @@ std::string NodeType() {
   return State().node_type;
 }
 
-const char* ProductVersion() { return Q7_VERSION_TEXT; }
+const char* ProductVersion() {
+  return Q7_VERSION_TEXT;
+}
 
 int SetHostName(const char* name) {
   if (name == nullptr) {
@@ -207,8 +209,8 @@ int DetermineLocalHost(char* buf, int len) {
   if (fw::Uname(&u) != 0) {
     return fw::kNotFound;
   }
-  const std::size_t n = std::min<std::size_t>(static_cast<std::size_t>(len) - 1,
-                                              std::strlen(u.nodename));
+  const std::size_t n =
+      std::min<std::size_t>(static_cast<std::size_t>(len) - 1, std::strlen(u.nodename));
   std::memcpy(buf, u.nodename, n);
   buf[n] = '\0';
   return fw::kOk;

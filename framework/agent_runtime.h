@@ -10,10 +10,9 @@
 #include <sys/utsname.h>
 
 #include <functional>
+#include <nlohmann/json_fwd.hpp>
 #include <string>
 #include <vector>
-
-#include <nlohmann/json_fwd.hpp>
 
 // A take-action command routed to an agent. The framework owns it; the agent acknowledges it
 // with ctuna::FinishedAutomationCommand.

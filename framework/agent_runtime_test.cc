@@ -2,16 +2,15 @@
 
 #include "framework/agent_runtime.h"
 
+#include <gtest/gtest.h>
 #include <httplib.h>
 #include <sys/utsname.h>
 
 #include <atomic>
 #include <cstring>
 #include <future>
-#include <string>
-
-#include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
+#include <string>
 
 #include "framework/http_server.h"
 #include "framework/status.h"

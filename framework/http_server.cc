@@ -5,10 +5,9 @@
 #include <cerrno>
 #include <chrono>
 #include <cstring>
+#include <nlohmann/json.hpp>
 #include <string>
 #include <thread>
-
-#include <nlohmann/json.hpp>
 
 #include "framework/agent_runtime.h"
 #include "framework/runtime_state.h"
@@ -72,7 +71,9 @@ nlohmann::json Health() {
 
 HttpServer::HttpServer() : server_(std::make_unique<httplib::Server>()) {}
 
-HttpServer::~HttpServer() { Stop(); }
+HttpServer::~HttpServer() {
+  Stop();
+}
 
 bool HttpServer::ParseAddress(const std::string& address, std::string* host, int* port) {
   const auto colon = address.rfind(':');
@@ -129,12 +130,10 @@ void HttpServer::InstallRoutes() {
                  what.c_str());
         ReplyError(res, 500, "internal error: " + what);
       });
-  s.Get("/healthz", [](const httplib::Request&, httplib::Response& res) {
-    ReplyJson(res, 200, Health());
-  });
-  s.Get("/api/v1/agent", [](const httplib::Request&, httplib::Response& res) {
-    ReplyJson(res, 200, AgentInfo());
-  });
+  s.Get("/healthz",
+        [](const httplib::Request&, httplib::Response& res) { ReplyJson(res, 200, Health()); });
+  s.Get("/api/v1/agent",
+        [](const httplib::Request&, httplib::Response& res) { ReplyJson(res, 200, AgentInfo()); });
 }
 
 int HttpServer::Start(const std::string& address, std::string* error) {
@@ -159,8 +158,8 @@ int HttpServer::Start(const std::string& address, std::string* error) {
     *error = "cannot bind " + address + ": " + std::strerror(errno);
     return kIoError;
   }
-  bound_address_ = (host.find(':') != std::string::npos ? "[" + host + "]" : host) + ":" +
-                   std::to_string(port);
+  bound_address_ =
+      (host.find(':') != std::string::npos ? "[" + host + "]" : host) + ":" + std::to_string(port);
   thread_ = std::thread([this] {
     SetThreadName("HTTP Server");
     server_->listen_after_bind();

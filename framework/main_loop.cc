@@ -70,8 +70,7 @@ int kunmain(int /*argc*/, char** /*argv*/) {
   std::string error;
   std::string address_file;
   if (server.Start(address, &error) == fw::kOk) {
-    Q7_TRACE(kUnit, fw::kTraceSummary, "HTTP API listening on %s",
-             server.bound_address().c_str());
+    Q7_TRACE(kUnit, fw::kTraceSummary, "HTTP API listening on %s", server.bound_address().c_str());
     address_file = AddressFilePath();
     if (!address_file.empty()) {
       WriteAddressFile(address_file, server.bound_address());

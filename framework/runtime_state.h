@@ -8,11 +8,10 @@
 #include <condition_variable>
 #include <functional>
 #include <mutex>
+#include <nlohmann/json.hpp>
 #include <string>
 #include <utility>
 #include <vector>
-
-#include <nlohmann/json.hpp>
 
 #include "framework/agent_runtime.h"
 

@@ -37,8 +37,8 @@ int StartTracing(std::string* error) {
     }
     const std::string logs = home + "logs/";
     if (::mkdir(logs.c_str(), 0755) != 0 && errno != EEXIST) {
-      *error = "cannot create " + logs + ": " + std::strerror(errno) +
-               "; tracing to standard error";
+      *error =
+          "cannot create " + logs + ": " + std::strerror(errno) + "; tracing to standard error";
       return kIoError;
     }
     path = logs + "q7agent.log";

@@ -28,15 +28,19 @@ bool RegisterTableInit(std::string_view name, TableInitFunction init) {
 
 int InitAllTables() {
   int initialised = 0;
+  std::string absent;
   for (std::size_t i = 0; i < kTableLoadOrder.size(); ++i) {
     const std::string name(kTableLoadOrder[i]);
     if (Inits()[i] == nullptr) {
-      Q7_TRACE(kUnit, fw::kTraceSummary, "kq7_%s_init is not available in this build", name.c_str());
+      absent += (absent.empty() ? "" : " ") + name;
       continue;
     }
     Q7_TRACE(kUnit, fw::kTraceDetail, "kq7_%s_init", name.c_str());
     Inits()[i]();
     ++initialised;
+  }
+  if (!absent.empty()) {
+    Q7_TRACE(kUnit, fw::kTraceSummary, "tables not available in this build: %s", absent.c_str());
   }
   return initialised;
 }

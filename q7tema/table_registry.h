@@ -14,10 +14,10 @@ namespace q7tema {
 
 // kq7_<name>_init names, in load order.
 inline constexpr std::array<std::string_view, 23> kTableLoadOrder = {
-    "q7agntdts", "q7agntmsgs", "q7appot",    "q7appsm",  "q7clntapp", "q7clntot",
-    "q7clntptns", "q7clntsm",  "q7clntsrv",  "q7srvappsm", "q7srvot", "q7srvsm",
-    "q7txins",   "q7txot",     "q7txptns",   "q7txsm",   "q7txcs",    "q7appcs",
-    "q7clntcs",  "q7srvcs",    "q7subtxsm",  "q7subtxot", "q7subtxins"};
+    "q7agntdts",  "q7agntmsgs", "q7appot",   "q7appsm",    "q7clntapp", "q7clntot",
+    "q7clntptns", "q7clntsm",   "q7clntsrv", "q7srvappsm", "q7srvot",   "q7srvsm",
+    "q7txins",    "q7txot",     "q7txptns",  "q7txsm",     "q7txcs",    "q7appcs",
+    "q7clntcs",   "q7srvcs",    "q7subtxsm", "q7subtxot",  "q7subtxins"};
 
 using TableInitFunction = void (*)();
 

@@ -1,0 +1,25 @@
+#!/bin/sh
+# Lays out a q7agent home at $PREFIX: bin/ (installed by cmake), lib/, config/, logs/ and
+# the collector data directory zorvan6/dpx/data/.
+# Existing configuration files are kept: an operator's edits are never overwritten.
+set -eu
+: "${PREFIX:?PREFIX must name the home directory}"
+here=$(cd "$(dirname "$0")" && pwd)
+home="${PREFIX%/}/"
+
+mkdir -p "${home}bin" "${home}lib" "${home}config" "${home}logs"
+# The collector's data directory named by the default KQ7DPXLOGPATH.
+mkdir -p "${home}zorvan6/dpx/data"
+
+host=$(uname -n | cut -c1-24 | cut -d. -f1)
+install_once() {  # install_once SOURCE TARGET
+  if [ -e "$2" ]; then
+    echo "kept   $2"
+  else
+    sed "s|@HOME@|${home}|g" "$1" > "$2.tmp" && chmod 0644 "$2.tmp" && mv "$2.tmp" "$2"
+    echo "wrote  $2"
+  fi
+}
+install_once "$here/host_q7.cfg" "${home}config/${host}_q7.cfg"
+install_once "$here/q7details.properties" "${home}config/q7details.properties"
+install_once "$here/q7.env" "${home}config/q7.env"

@@ -1,0 +1,197 @@
+// Start-up and shutdown of the agent: naming, the message file name, the loader and command
+// callbacks, and CtMain's ordering of collector supervision around the main loop.
+
+#include "tama/startup.h"
+
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/utsname.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <string>
+#include <vector>
+
+#include "framework/agent_runtime.h"
+#include "framework/trace_capture.h"
+#include "tama/agent_globals.h"
+#include "tama/agent_hooks.h"
+#include "tama/ct_main.h"
+#include "tama/signal_manager.h"
+
+namespace {
+
+void fakeNodeName(const std::string& name) {
+  fw::SetUnameForTesting([name](struct utsname* u) {
+    std::memset(u, 0, sizeof(*u));
+    std::strncpy(u->nodename, name.c_str(), sizeof(u->nodename) - 1);
+    return 0;
+  });
+}
+
+class StartupTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    fw::ResetRuntimeForTesting();
+    char tmpl[] = "/tmp/q7start-XXXXXX";
+    ASSERT_NE(nullptr, mkdtemp(tmpl));
+    home_ = std::string(tmpl) + "/";
+    setenv("Q7_HOME", home_.c_str(), 1);
+    setenv("Q7_HTTP_ADDRESS", "127.0.0.1:0", 1);
+  }
+  void TearDown() override {
+    tama::agentHooks() = tama::AgentHooks{};
+    fw::ResetRuntimeForTesting();
+    unsetenv("Q7_HOME");
+    unsetenv("Q7_HTTP_ADDRESS");
+    unsetenv("DPX_NOSTART");
+    std::filesystem::remove_all(home_);
+  }
+  std::string home_;
+};
+
+// The agent name keeps 24 characters of the node name; the short name stops at the first dot.
+TEST_F(StartupTest, AgentNamesFromNodeName) {
+  fakeNodeName("abcdefghijklmnopqrstuvwxyz1234");
+  tama::nameAgent();
+  EXPECT_STREQ("abcdefghijklmnopqrstuvwx", kq1_agent_name);
+  EXPECT_STREQ("abcdefghijklmnopqrstuvwx", kq1_short_agent_name);
+
+  fakeNodeName("hostA.part2");
+  tama::nameAgent();
+  EXPECT_STREQ("hostA.part2", kq1_agent_name);
+  EXPECT_STREQ("hostA", kq1_short_agent_name);
+  EXPECT_EQ("hostA", fw::HostName());
+
+  fw::SetUnameForTesting([](struct utsname*) { return -1; });
+  tama::nameAgent();
+  EXPECT_STREQ("$UNKNOWN$", kq1_agent_name);
+}
+
+TEST_F(StartupTest, MessageFileNameFromEnvironment) {
+  fw::TraceCapture capture;
+  unsetenv("KQ7_MSG_FILE_NAME");
+  prepareMsgFileName();
+  EXPECT_STREQ("./kq1msg.log", KQ1_MsgFileName);
+  setenv("KQ7_MSG_FILE_NAME", "agent.msgs", 1);
+  prepareMsgFileName();
+  EXPECT_STREQ("./agent.msgs", KQ1_MsgFileName);
+  EXPECT_TRUE(capture.contains("KQ1_MsgFileName<./agent.msgs>"));
+  unsetenv("KQ7_MSG_FILE_NAME");
+}
+
+// The loader declares the five affinities in order; every KQ7 command is acknowledged.
+TEST_F(StartupTest, LoaderAndCommandCallback) {
+  EXPECT_EQ(0, LoadAgents());
+  const std::vector<std::string> expected{"AFF_FEAT_DM_PARITY", "AFF_FEAT_AGENT_MGMT",
+                                          "AFF_FEAT_INTERNATIONALIZATION", "AFF_V1",
+                                          "0000000000000000000100000000000000000000000"};
+  EXPECT_EQ(expected, fw::Affinities());
+  CtunaAutomationCapsule capsule{"KQ7 anything", false};
+  EXPECT_EQ(1, HandleTakeAction(&capsule));
+  EXPECT_TRUE(capsule.finished);
+}
+
+// Records what the collector monitors were asked to do, in order.
+std::vector<std::string> g_events;
+
+class FakeMonitor : public tama::CollectorMonitor {
+ public:
+  explicit FakeMonitor(std::string which) : which_(std::move(which)) {}
+  int start() override {
+    g_events.push_back("start " + which_);
+    return 0;
+  }
+  int stop() override {
+    g_events.push_back("stop " + which_);
+    return 0;
+  }
+
+ private:
+  std::string which_;
+};
+
+void installFakeHooks() {
+  g_events.clear();
+  tama::AgentHooks& hooks = tama::agentHooks();
+  hooks.make_collector_monitor = [](const tama::CollectorMonitorSpec& spec) {
+    const std::string which = spec.start_argv.back();
+    g_events.push_back("create " + which + " " +
+                       std::filesystem::path(spec.pid_file).filename().string());
+    return std::unique_ptr<tama::CollectorMonitor>(new FakeMonitor(which));
+  };
+  hooks.start_analyzer = [] { g_events.push_back("analyzer start"); };
+  hooks.shutdown_analyzer = [] { g_events.push_back("analyzer shutdown"); };
+  hooks.join_analyzer = [] { g_events.push_back("analyzer join"); };
+  hooks.send_agent_message = [](const char* key, int severity, const std::vector<std::string>&) {
+    g_events.push_back(std::string("message ") + key + " " + std::to_string(severity));
+    fw::RequestShutdown(1);  // leave the main loop at once
+  };
+}
+
+// The writer process is started before the capture process and stopped before it too; the
+// analyzer shuts down after both.
+TEST_F(StartupTest, CtMainOrdersSupervisionAroundMainLoop) {
+  fakeNodeName("hostA.part2");
+  installFakeHooks();
+  unsetenv("DPX_NOSTART");
+  char arg0[] = "q7agent";
+  char* argv[] = {arg0, nullptr};
+  EXPECT_EQ(0, CtMain(1, argv));
+  const std::vector<std::string> expected{"analyzer start",
+                                          "create analyzer zolt414_hostA.part2.pid",
+                                          "create collector zelt_hostA.part2.pid",
+                                          "start analyzer",
+                                          "start collector",
+                                          "message RT_AGENT_STARTED 4",
+                                          "stop analyzer",
+                                          "stop collector",
+                                          "analyzer shutdown",
+                                          "analyzer join"};
+  EXPECT_EQ(expected, g_events);
+}
+
+// DPX_NOSTART, even empty, means no monitor is created, started or stopped.
+TEST_F(StartupTest, NoStartSuppressesSupervision) {
+  installFakeHooks();
+  setenv("DPX_NOSTART", "", 1);
+  char arg0[] = "q7agent";
+  char* argv[] = {arg0, nullptr};
+  EXPECT_EQ(0, CtMain(1, argv));
+  const std::vector<std::string> expected{"analyzer start", "message RT_AGENT_STARTED 4",
+                                          "analyzer shutdown", "analyzer join"};
+  EXPECT_EQ(expected, g_events);
+}
+
+// SIGTERM reaches the manager thread, which asks the main loop to return. As in the agent,
+// the manager is never destroyed: its thread is ending on its own.
+TEST_F(StartupTest, SignalManagerTurnsSigtermIntoShutdown) {
+  fw::TraceCapture capture;
+  static SignalManager* manager = new SignalManager();
+  ASSERT_NE(nullptr, manager);
+  ASSERT_EQ(0, kill(getpid(), SIGTERM));
+  for (int i = 0; i < 500 && !capture.contains("Termination signal received."); ++i) {
+    usleep(10000);
+  }
+  EXPECT_TRUE(fw::ShutdownRequested());
+  EXPECT_TRUE(capture.contains("Stop signal received."));
+  EXPECT_TRUE(capture.contains("Termination signal received.  Exiting."));
+}
+
+// Destroying the manager while it waits cancels and joins its thread.
+TEST_F(StartupTest, SignalManagerDestructorCancelsWaitingThread) {
+  fw::TraceCapture capture;
+  {
+    SignalManager manager;
+    for (int i = 0; i < 500 && !capture.contains("Manager thread waiting for a signal."); ++i) {
+      usleep(10000);
+    }
+  }
+  EXPECT_TRUE(capture.contains("Shutdown commencing."));
+  EXPECT_TRUE(capture.contains("Termination pending cancellation of manager thread."));
+  EXPECT_TRUE(capture.contains("Manager thread terminated."));
+  EXPECT_FALSE(fw::ShutdownRequested());
+}
+
+}  // namespace

@@ -1,0 +1,183 @@
+// The real q7agent binary: command line, start-up in a fresh home, the HTTP API, and orderly
+// shutdown on SIGTERM and SIGINT.
+
+#include <gtest/gtest.h>
+#include <httplib.h>
+#include <signal.h>
+#include <sys/wait.h>
+
+#include <chrono>
+#include <filesystem>
+#include <nlohmann/json.hpp>
+#include <string>
+
+#include "tests/agent_process.h"
+
+namespace q7test {
+namespace {
+
+using namespace std::chrono_literals;
+
+class AgentE2ETest : public ::testing::Test {
+ protected:
+  std::map<std::string, std::string> env() const {
+    return {{"Q7_HOME", home_.path()}, {"Q7_HTTP_ADDRESS", "127.0.0.1:0"},
+            {"Q7_TRACE", "*=ALL"},     {"Q7_TRACE_FILE", ""},
+            {"DPX_NOSTART", ""},       {"TZ", "UTC"}};
+  }
+  std::string tracePath() const { return home_.path() + "logs/q7agent.log"; }
+  std::string trace() const { return readFile(tracePath()); }
+  std::string base() const { return home_.path() + "zorvan6/"; }
+
+  // Starts the agent and waits until its API answers; returns the bound address.
+  std::string start() {
+    agent_ = std::make_unique<AgentProcess>(std::vector<std::string>{}, env());
+    std::string address;
+    const bool up = waitFor(
+        [&] {
+          address = readFile(home_.path() + "logs/q7agent.addr");
+          if (address.empty() || address.back() != '\n') {
+            return false;
+          }
+          address.pop_back();
+          return true;
+        },
+        10s);
+    EXPECT_TRUE(up) << trace();
+    return address;
+  }
+
+  nlohmann::json get(const std::string& address, const std::string& path, int* status) {
+    httplib::Client client("http://" + address);
+    client.set_connection_timeout(2);
+    auto res = client.Get(path.c_str());
+    if (!res) {
+      *status = -1;
+      return {};
+    }
+    *status = res->status;
+    return nlohmann::json::parse(res->body, nullptr, false);
+  }
+
+  // Sends sig and checks the exit status 0 within 2 seconds.
+  void stopWith(int sig) {
+    const auto sent = std::chrono::steady_clock::now();
+    agent_->signal(sig);
+    const auto status = agent_->wait(5s);
+    ASSERT_TRUE(status.has_value()) << "agent did not exit";
+    EXPECT_LT(std::chrono::steady_clock::now() - sent, 2s);
+    ASSERT_TRUE(WIFEXITED(*status)) << "status " << *status;
+    EXPECT_EQ(0, WEXITSTATUS(*status));
+  }
+
+  TempHome home_;
+  std::unique_ptr<AgentProcess> agent_;
+};
+
+// --help and --version print, exit 0 and create nothing in the home.
+TEST_F(AgentE2ETest, HelpAndVersionStartNothing) {
+  std::string out;
+  int status = runToCompletion({"--help"}, env(), &out);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(0, WEXITSTATUS(status));
+  EXPECT_NE(std::string::npos, out.find("Q7_HTTP_ADDRESS"));
+  out.clear();
+  status = runToCompletion({"--version"}, env(), &out);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(0, WEXITSTATUS(status));
+  EXPECT_EQ("q7agent 01.00.00\n", out);
+  EXPECT_TRUE(std::filesystem::is_empty(home_.path()));
+  out.clear();
+  status = runToCompletion({"--no-such-option"}, env(), &out);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_NE(0, WEXITSTATUS(status));
+}
+
+// A first start lays out the base directory tree, serves the API, and SIGTERM ends the agent
+// in the documented order with exit status 0.
+TEST_F(AgentE2ETest, StartsServesAndStopsOnSigterm) {
+  home_.writeFile("config/q7details.properties", "Colour=red\nShape=round\n");
+  home_.writeFile("config/" + shortHostName() + "_q7.cfg", "[AGENT]\nColour=blue\n");
+  const std::string address = start();
+
+  for (const char* dir :
+       {"logs", "odi/dpx", "odi/lyn", "odi/arm", "arm/log/lyn/delete", "lyn/Mgmt/Log"}) {
+    EXPECT_TRUE(isDirectory(base() + dir)) << dir;
+  }
+
+  int status = 0;
+  nlohmann::json health = get(address, "/healthz", &status);
+  EXPECT_EQ(200, status);
+  EXPECT_EQ("ok", health.value("status", ""));
+  EXPECT_EQ("not supervised (DPX_NOSTART)", health.value("collector", ""));
+
+  nlohmann::json agent = get(address, "/api/v1/agent", &status);
+  EXPECT_EQ(200, status);
+  EXPECT_EQ("01.00.00", agent.value("version", ""));
+  EXPECT_EQ(shortHostName(), agent.value("short_agent_name", ""));
+  EXPECT_FALSE(agent.value("system_name", "").empty());
+  EXPECT_EQ("blue", agent["properties"].value("Colour", ""));  // the cfg file wins
+  EXPECT_EQ("round", agent["properties"].value("Shape", ""));
+  EXPECT_EQ(base().substr(0, base().size() - 1), agent["properties"].value("AgentBaseDir", ""));
+  EXPECT_EQ(5u, agent["affinities"].size());
+
+  get(address, "/no/such/path", &status);
+  EXPECT_EQ(404, status);
+
+  stopWith(SIGTERM);
+  const std::string t = trace();
+  for (const char* text : {"KQ1_MsgFileName<./kq1msg.log>", "kq1_agent_name<",
+                           "KQ1_BaseDir = ", "KQ1_ConfigPath = ", "Got config value Colour = blue",
+                           "Base dir=", "LYN data dir=[", "Overtime Interval set to 5",
+                           "Summary Interval set to 24"}) {
+    EXPECT_NE(std::string::npos, t.find(text)) << text;
+  }
+  // Shutdown in order: signal, main loop returns, analyzer shut down.
+  const auto received = t.find("Termination signal received.  Exiting.");
+  const auto waiting = t.find("Waiting for Analyzer to shutdown.");
+  const auto completed = t.find("Analyzer Completed Shutdown.");
+  ASSERT_NE(std::string::npos, received);
+  ASSERT_NE(std::string::npos, waiting);
+  ASSERT_NE(std::string::npos, completed);
+  EXPECT_LT(received, waiting);
+  EXPECT_LT(waiting, completed);
+  EXPECT_FALSE(std::filesystem::exists(home_.path() + "logs/q7agent.addr"));
+}
+
+// SIGINT stops the agent just as SIGTERM does.
+TEST_F(AgentE2ETest, StopsOnSigint) {
+  start();
+  stopWith(SIGINT);
+  EXPECT_NE(std::string::npos, trace().find("Stop signal received."));
+}
+
+// Only SIGINT and SIGTERM are taken over: SIGUSR1 keeps its default action.
+TEST_F(AgentE2ETest, OtherSignalsKeepTheirDefaultAction) {
+  start();
+  agent_->signal(SIGUSR1);
+  const auto status = agent_->wait(5s);
+  ASSERT_TRUE(status.has_value());
+  ASSERT_TRUE(WIFSIGNALED(*status));
+  EXPECT_EQ(SIGUSR1, WTERMSIG(*status));
+}
+
+// A malformed configuration file and a junk properties file leave clear traces and defaults;
+// the agent still runs and stops cleanly.
+TEST_F(AgentE2ETest, BadConfigurationIsTracedNotFatal) {
+  home_.writeFile("config/q7details.properties",
+                  std::string("Good=yes\n\x01\x02\x00\xff junk\n", 18) + std::string(10000, 'x') +
+                      "\nKQ7OVERTIMEINTERVAL=abc\n");
+  home_.writeFile("config/" + shortHostName() + "_q7.cfg", "[AGENT\nbroken line\n");
+  const std::string address = start();
+  int status = 0;
+  nlohmann::json agent = get(address, "/api/v1/agent", &status);
+  EXPECT_EQ(200, status);
+  EXPECT_EQ("yes", agent["properties"].value("Good", ""));
+  stopWith(SIGTERM);
+  const std::string t = trace();
+  EXPECT_NE(std::string::npos, t.find("Error: unable to parse config file"));
+  EXPECT_NE(std::string::npos, t.find("Invalid Overtime Interval 0"));
+}
+
+}  // namespace
+}  // namespace q7test
