@@ -21,8 +21,9 @@ constexpr std::size_t kMaxOriginNode = 32;
 }  // namespace
 
 RuntimeState& State() {
-  static RuntimeState state;
-  return state;
+  // Never destroyed: threads that outlive main (the signal thread) may still request shutdown.
+  static auto* state = new RuntimeState;
+  return *state;
 }
 
 void RegisterAgentLoader(AgentLoader loader) {

@@ -114,6 +114,13 @@ void SignalManager::stopManagerThread() {
   started_ = false;
 }
 
+void SignalManager::joinManagerThreadForTesting() {
+  if (started_) {
+    pthread_join(managerThread_, nullptr);
+    started_ = false;
+  }
+}
+
 void SignalManager::waitForSignal() {
   sigset_t set;
   sigemptyset(&set);

@@ -28,6 +28,12 @@ class SignalManager {
   // Cancels and joins the manager thread; does nothing when called on that thread.
   void stopManagerThread();
 
+  // Joins the manager thread without cancelling it, once it has ended on its own after a stop
+  // signal (tests only: the agent leaves it unjoined).
+  void joinManagerThreadForTesting();
+  // The manager thread, for signals aimed at it alone (tests).
+  pthread_t managerThreadForTesting() const { return managerThread_; }
+
   // Blocks SIGINT and SIGTERM in the calling thread.
   static void blockSignals();
   // Waits until SIGINT or SIGTERM arrives; sigwait errors and other signals wait again.

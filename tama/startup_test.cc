@@ -164,16 +164,13 @@ TEST_F(StartupTest, NoStartSuppressesSupervision) {
   EXPECT_EQ(expected, g_events);
 }
 
-// SIGTERM reaches the manager thread, which asks the main loop to return. As in the agent,
-// the manager is never destroyed: its thread is ending on its own.
+// SIGTERM reaches the manager thread, which asks the main loop to return and ends.
 TEST_F(StartupTest, SignalManagerTurnsSigtermIntoShutdown) {
   fw::TraceCapture capture;
-  static SignalManager* manager = new SignalManager();
-  ASSERT_NE(nullptr, manager);
-  ASSERT_EQ(0, kill(getpid(), SIGTERM));
-  for (int i = 0; i < 500 && !capture.contains("Termination signal received."); ++i) {
-    usleep(10000);
-  }
+  SignalManager manager;
+  // Aimed at this manager: an earlier CtMain in the same process left its own one waiting.
+  ASSERT_EQ(0, pthread_kill(manager.managerThreadForTesting(), SIGTERM));
+  manager.joinManagerThreadForTesting();
   EXPECT_TRUE(fw::ShutdownRequested());
   EXPECT_TRUE(capture.contains("Stop signal received."));
   EXPECT_TRUE(capture.contains("Termination signal received.  Exiting."));
