@@ -14,6 +14,7 @@
 
 #include "framework/http_server.h"
 #include "framework/status.h"
+#include "tests/support/scratch_dir.h"
 
 namespace fw {
 namespace {
@@ -95,9 +96,8 @@ TEST(HttpServerTest, ParsesAddresses) {
 
 // The main loop calls the loader, serves the API and returns 0 on a shutdown request.
 TEST_F(AgentRuntimeTest, MainLoopServesUntilShutdown) {
-  char tmpl[] = "/tmp/q7fwrt-XXXXXX";
-  ASSERT_NE(nullptr, mkdtemp(tmpl));
-  const std::string home = std::string(tmpl) + "/";
+  q7test::ScratchDir scratch;
+  const std::string home = scratch.path() + "/";
   setenv("Q7_HOME", home.c_str(), 1);
   setenv("Q7_HTTP_ADDRESS", "127.0.0.1:0", 1);
   static std::atomic<bool> loaded{false};
@@ -139,8 +139,6 @@ TEST_F(AgentRuntimeTest, MainLoopServesUntilShutdown) {
   EXPECT_TRUE(ShutdownRequested());
   unsetenv("Q7_HOME");
   unsetenv("Q7_HTTP_ADDRESS");
-  std::string cmd = "rm -rf " + home;
-  EXPECT_EQ(0, system(cmd.c_str()));
 }
 
 }  // namespace

@@ -91,15 +91,5 @@ TEST(ClockTest, InjectedClockAndRestore) {
   EXPECT_LE(Now(), real + 5);
 }
 
-TEST(ClockTest, ProcessingTimerIsMonotonicNanoseconds) {
-  const int64_t a = QbrmBestGetCurrentTime();
-  struct timespec pause = {0, 2000000};
-  nanosleep(&pause, nullptr);
-  const int64_t b = QbrmBestGetCurrentTime();
-  EXPECT_GT(a, 0);
-  EXPECT_GE(b - a, 2000000);
-  EXPECT_LT(b - a, 2000000000);
-}
-
 }  // namespace
 }  // namespace fw

@@ -9,6 +9,7 @@
 #include <string>
 
 #include "framework/status.h"
+#include "tests/support/scratch_dir.h"
 
 namespace fw {
 namespace {
@@ -93,11 +94,6 @@ TEST(ConfigFileTest, IndentedBracketAfterEntryIsContinuation) {
   EXPECT_EQ("|x|\n", ParseOk("  [x]\n"));
 }
 
-TEST(ConfigFileTest, EmptyTextHasNoInstances) {
-  EXPECT_EQ("", ParseOk(""));
-  EXPECT_EQ("", ParseOk("\n; only comments\n# here\n"));
-}
-
 // inih reads 199 characters whole; 200 would be split, so that fails and names its line.
 TEST(ConfigFileTest, LineLengthLimit) {
   const std::string value199(197, 'v');
@@ -130,23 +126,11 @@ TEST(ConfigFileTest, BinaryJunkDoesNotCrash) {
   }
 }
 
-// A failed parse leaves the previous contents alone.
-TEST(ConfigFileTest, FailureKeepsOutput) {
-  ConfigFile config;
-  ASSERT_EQ(kOk, ConfigFile::ParseText("[S]\na=1\n", &config, nullptr));
-  EXPECT_EQ(kParseError, ConfigFile::ParseText("[T]\nb=2\nbad\n", &config, nullptr));
-  EXPECT_EQ("|S|a=1\n", Dump(config));
-}
-
 class ConfigFileDiskTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    char dir[] = "/tmp/q7fw-XXXXXX";
-    ASSERT_NE(nullptr, mkdtemp(dir));
-    dir_ = dir;
-  }
-  void TearDown() override { std::filesystem::remove_all(dir_); }
+  void SetUp() override { dir_ = scratch_.path(); }
 
+  q7test::ScratchDir scratch_;
   std::string dir_;
 };
 

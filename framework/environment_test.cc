@@ -11,6 +11,7 @@
 #include <string>
 
 #include "framework/status.h"
+#include "tests/support/scratch_dir.h"
 
 namespace fw {
 namespace {
@@ -26,13 +27,10 @@ class EnvironmentTest : public ::testing::Test {
       saved_[name] = value ? std::optional<std::string>(value) : std::nullopt;
       unsetenv(name);
     }
-    char dir[] = "/tmp/q7fw-XXXXXX";
-    ASSERT_NE(nullptr, mkdtemp(dir));
-    dir_ = dir;
+    dir_ = scratch_.path();
     setenv("Q7_CONFIG_DIR", dir_.c_str(), 1);
   }
   void TearDown() override {
-    std::filesystem::remove_all(dir_);
     for (const auto& [name, value] : saved_) {
       if (value) {
         setenv(name.c_str(), value->c_str(), 1);
@@ -54,6 +52,7 @@ class EnvironmentTest : public ::testing::Test {
     return value;
   }
 
+  q7test::ScratchDir scratch_;
   std::string dir_;
 
  private:

@@ -14,6 +14,7 @@
 
 #include "framework/status.h"
 #include "framework/trace_capture.h"
+#include "tests/support/scratch_dir.h"
 
 namespace fw {
 namespace {
@@ -157,32 +158,14 @@ TEST(TraceRecordTest, ThreadNames) {
   }).join();
 }
 
-TEST(TraceRecordTest, CaptureRestoresMasksAndClears) {
-  ASSERT_EQ(kOk, TraceConfigure("tama=DETAIL", nullptr));
-  {
-    TraceCapture capture("*=NONE");
-    EXPECT_EQ(0u, TraceMask("tama"));
-    TraceWrite("tama", kTraceError, "f", "one");
-    capture.clear();
-    EXPECT_TRUE(capture.lines().empty());
-  }
-  EXPECT_EQ(kTraceDetail, TraceMask("tama"));
-  ASSERT_EQ(kOk, TraceConfigure("", nullptr));
-}
-
 // Each test writes into its own temporary directory; records go back to stderr afterwards.
 class TraceFileTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char dir[] = "/tmp/q7fw-XXXXXX";
-    ASSERT_NE(nullptr, mkdtemp(dir));
-    dir_ = dir;
-    path_ = dir_ + "/trace.log";
+    dir_ = scratch_.path();
+    path_ = scratch_.file("trace.log");
   }
-  void TearDown() override {
-    TraceClose();
-    std::filesystem::remove_all(dir_);
-  }
+  void TearDown() override { TraceClose(); }
 
   void Open(std::size_t max_bytes, std::size_t max_files) {
     std::string error;
@@ -198,6 +181,7 @@ class TraceFileTest : public ::testing::Test {
     return lines;
   }
 
+  q7test::ScratchDir scratch_;
   std::string dir_;
   std::string path_;
 };

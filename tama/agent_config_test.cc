@@ -14,6 +14,7 @@
 #include "tama/agent_globals.h"
 #include "tama/agent_properties.h"
 #include "tama/cconfig.h"
+#include "tests/support/scratch_dir.h"
 
 namespace {
 
@@ -26,9 +27,7 @@ void RecordBundle(const char* path) {
 class AgentConfigTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char dir[] = "/tmp/q7cfg-XXXXXX";
-    ASSERT_NE(nullptr, mkdtemp(dir));
-    root_ = dir;
+    root_ = scratch_.path();
     home_ = root_ + "/home/";
     config_dir_ = root_ + "/config/";
     std::filesystem::create_directories(home_);
@@ -50,7 +49,6 @@ class AgentConfigTest : public ::testing::Test {
     unsetenv("KQ7_CLASSPATH");
     AgentProperties::resetForTesting();
     CConfig::resetForTesting();
-    std::filesystem::remove_all(root_);
   }
 
   void WriteConfig(const std::string& text) { Write(config_dir_ + "host_q7.cfg", text); }
@@ -62,6 +60,7 @@ class AgentConfigTest : public ::testing::Test {
   }
   static std::string Prop(const char* name) { return AgentProperties::getAgentProperty(name); }
 
+  q7test::ScratchDir scratch_;
   std::string root_;
   std::string home_;
   std::string config_dir_;

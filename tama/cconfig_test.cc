@@ -10,6 +10,7 @@
 
 #include "core/runtime/paths.h"
 #include "framework/trace_capture.h"
+#include "tests/support/scratch_dir.h"
 
 namespace {
 
@@ -18,15 +19,14 @@ class CConfigTest : public ::testing::Test {
   void SetUp() override {
     CConfig::resetForTesting();
     unsetenv("OXA_COLLECTOR");
-    char dir[] = "/tmp/q7cfg-XXXXXX";
-    ASSERT_NE(nullptr, mkdtemp(dir));
-    root_ = dir;
+    root_ = scratch_.path();
   }
   void TearDown() override {
     CConfig::resetForTesting();
     unsetenv("OXA_COLLECTOR");
-    std::filesystem::remove_all(root_);
   }
+
+  q7test::ScratchDir scratch_;
 
   // Index of the first captured line containing text, or -1.
   static int LineOf(const fw::TraceCapture& capture, const std::string& text) {

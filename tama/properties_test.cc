@@ -9,24 +9,21 @@
 #include <string>
 
 #include "framework/trace_capture.h"
+#include "tests/support/scratch_dir.h"
 
 namespace {
 
 class PropertiesTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char dir[] = "/tmp/q7props-XXXXXX";
-    ASSERT_NE(nullptr, mkdtemp(dir));
-    root_ = dir;
-    path_ = root_ + "/q7details.properties";
+    root_ = scratch_.path();
+    path_ = scratch_.file("q7details.properties");
   }
-  void TearDown() override { std::filesystem::remove_all(root_); }
 
-  void Write(const std::string& bytes) { std::ofstream(path_, std::ios::binary) << bytes; }
-  std::string Read() {
-    std::ifstream in(path_, std::ios::binary);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  }
+  void Write(const std::string& bytes) { scratch_.write("q7details.properties", bytes); }
+  std::string Read() { return scratch_.read("q7details.properties"); }
+
+  q7test::ScratchDir scratch_;
 
   std::string root_;
   std::string path_;

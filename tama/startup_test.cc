@@ -19,6 +19,7 @@
 #include "tama/agent_hooks.h"
 #include "tama/ct_main.h"
 #include "tama/signal_manager.h"
+#include "tests/support/scratch_dir.h"
 
 namespace {
 
@@ -34,9 +35,7 @@ class StartupTest : public ::testing::Test {
  protected:
   void SetUp() override {
     fw::ResetRuntimeForTesting();
-    char tmpl[] = "/tmp/q7start-XXXXXX";
-    ASSERT_NE(nullptr, mkdtemp(tmpl));
-    home_ = std::string(tmpl) + "/";
+    home_ = scratch_.path() + "/";
     setenv("Q7_HOME", home_.c_str(), 1);
     setenv("Q7_HTTP_ADDRESS", "127.0.0.1:0", 1);
   }
@@ -46,8 +45,8 @@ class StartupTest : public ::testing::Test {
     unsetenv("Q7_HOME");
     unsetenv("Q7_HTTP_ADDRESS");
     unsetenv("DPX_NOSTART");
-    std::filesystem::remove_all(home_);
   }
+  q7test::ScratchDir scratch_;
   std::string home_;
 };
 

@@ -16,26 +16,6 @@
 
 namespace q7test {
 
-TempHome::TempHome() {
-  char tmpl[] = "/tmp/q7e2e-XXXXXX";
-  if (::mkdtemp(tmpl) == nullptr) {
-    throw std::runtime_error("mkdtemp failed");
-  }
-  path_ = std::string(tmpl) + "/";
-}
-
-TempHome::~TempHome() {
-  std::error_code ec;
-  std::filesystem::remove_all(path_, ec);
-}
-
-void TempHome::writeFile(const std::string& relative, const std::string& content) const {
-  const std::filesystem::path p = path_ + relative;
-  std::filesystem::create_directories(p.parent_path());
-  std::ofstream out(p, std::ios::binary);
-  out << content;
-}
-
 std::string shortHostName() {
   struct utsname u {};
   ::uname(&u);

@@ -12,22 +12,23 @@
 #include <string>
 #include <vector>
 
+#include "tests/support/scratch_dir.h"
+
 namespace q7test {
 
-// A temporary directory from mkdtemp("/tmp/q7e2e-XXXXXX"), removed with its contents.
+// A temporary home from mkdtemp (see ScratchDir), its path with a trailing '/'.
 class TempHome {
  public:
-  TempHome();
-  ~TempHome();
-  TempHome(const TempHome&) = delete;
-  TempHome& operator=(const TempHome&) = delete;
+  TempHome() : path_(scratch_.path() + "/") {}
 
-  // The directory with a trailing '/'.
   const std::string& path() const { return path_; }
   // Writes a file below the home, creating its directory.
-  void writeFile(const std::string& relative, const std::string& content) const;
+  void writeFile(const std::string& relative, const std::string& content) const {
+    scratch_.write(relative, content);
+  }
 
  private:
+  ScratchDir scratch_;
   std::string path_;
 };
 

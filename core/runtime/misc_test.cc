@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "core/runtime/paths.h"
+#include "tests/support/scratch_dir.h"
 
 namespace {
 
@@ -50,12 +51,11 @@ TEST(NapTest, RaisedFlagSkipsRealSteps) {
 class FileHelpersTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    char dir[] = "/tmp/q7rt-XXXXXX";
-    ASSERT_NE(nullptr, mkdtemp(dir));
-    root_ = dir;
-    std::ofstream(root_ + "/file") << "0123456789";
+    root_ = scratch_.path();
+    scratch_.write("file", "0123456789");
   }
-  void TearDown() override { std::filesystem::remove_all(root_); }
+
+  q7test::ScratchDir scratch_;
   std::string root_;
 };
 
