@@ -216,10 +216,10 @@ bool IsBlank(char c) {
 
 bool DirectoryExists(const std::string& path, std::string* reason) {
   const std::size_t slash = path.rfind('/');
-  std::string dir = slash == std::string::npos ? "." : path.substr(0, slash);
-  if (dir.empty()) {
-    dir = "/";
-  }
+  // Built in one step: g++ 12 at -O3 warns falsely (-Wrestrict) on assigning a literal here.
+  const std::string dir = slash == std::string::npos ? std::string(".")
+                          : slash == 0               ? std::string("/")
+                                                     : path.substr(0, slash);
   struct stat st;
   if (stat(dir.c_str(), &st) != 0) {
     *reason = "trace directory " + dir + ": " + std::strerror(errno);
