@@ -6,6 +6,7 @@
 #   make bench    Release build of the benchmarks, then run them
 #   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/
 #   make asan / make tsan   sanitizer builds with their unit tests
+#   make test-tsan          the runtime primitives' tests under ThreadSanitizer
 
 SHELL := /bin/bash
 BUILD_TYPE ?= RelWithDebInfo
@@ -21,7 +22,7 @@ DEPS := cmake ninja-build g++ make pkg-config git curl \
 
 SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
 
-.PHONY: all deps build test demo bench install asan tsan clean format
+.PHONY: all deps build test test-tsan demo bench install asan tsan clean format
 
 all: build
 
@@ -45,6 +46,7 @@ build: deps build/build.ninja
 test: build
 	cd build && ctest --output-on-failure -j $(JOBS) --timeout 300
 	$(MAKE) --no-print-directory asan
+	$(MAKE) --no-print-directory test-tsan
 
 asan: deps
 	cmake -S . -B build-asan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_SANITIZE=ON
@@ -55,6 +57,12 @@ tsan: deps
 	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON
 	cmake --build build-tsan -j $(JOBS)
 	cd build-tsan && ctest --output-on-failure -j $(JOBS) -L unit --timeout 300
+
+# The concurrency primitives under ThreadSanitizer (part of make test).
+test-tsan: deps
+	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON
+	cmake --build build-tsan -j $(JOBS) --target runtime_test
+	build-tsan/bin/runtime_test --gtest_brief=1
 
 bench: deps
 	cmake -S . -B build-release $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Release -DQ7_BUILD_TESTS=OFF
