@@ -11,6 +11,7 @@
 
 std::atomic<unsigned long> CLOG::VLevel{2};
 int CLOG::fd = -1;
+CvelMutex CLOG::mutex;
 
 namespace {
 

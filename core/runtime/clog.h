@@ -12,10 +12,12 @@
 // There is no agent-owned log file: initLog and writeLog do nothing and fd is never used.
 //
 // Thread safety: every function may be called from any thread; formatting uses stack buffers and
-// the trace facility serialises the output. (The process-wide mutex this class is meant to own
-// comes with the thread primitives; no operation would take it anyway.)
+// the trace facility serialises the output. The process-wide mutex is constructed at start-up and
+// taken by no operation.
 
 #include <atomic>
+
+#include "core/runtime/cvel_mutex.h"
 
 class CLOG {
  public:
@@ -25,6 +27,8 @@ class CLOG {
   static std::atomic<unsigned long> VLevel;
   // Declared for the layout the agent expects; nothing opens or writes it.
   [[maybe_unused]] static int fd;
+  // Belongs to the class's layout; constructed with the program's statics, never locked.
+  static CvelMutex mutex;
 
   // Written when mask shares a bit with the unit's enabled classes; the mask is a class mask,
   // not a level (callers pass 2, the summary class). enter/exit prefix "ENTER, " / "EXIT, ".

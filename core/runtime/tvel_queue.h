@@ -1,0 +1,156 @@
+#pragma once
+
+// TvelQueue<T>: a fixed-capacity blocking FIFO ring shared between threads.
+//
+// Producers (any number) block in Put while the queue is full; the consumer waits in Get with a
+// timeout so that it can do periodic work when nothing arrives. Items are copied by value; the
+// array is allocated once at construction and nothing is allocated afterwards. The agent uses
+// one TvelQueue<_TYPED_TRANSACTION> of 2048 items between the data file readers and the
+// analyzer.
+//
+// Blocking goes through two manual-reset events, not-empty and not-full, which are signalled
+// and reset only under the queue mutex. A thread woken by them re-checks the count under the
+// mutex and waits again if another thread got there first.
+//
+// Ownership: the destructor frees the array but not what queued items point to; the consumer
+// empties the queue before destroying it. The queue must outlive every thread using it.
+//
+// Thread safety: Put from any thread; Get from the consumer (one thread in the agent, though
+// several are safe); IsFull and IsEmpty from any thread, as unlocked hints.
+
+#include <atomic>
+#include <cstdio>
+#include <cstdlib>
+#include <memory>
+#include <new>
+
+#include "core/runtime/cvel_event.h"
+#include "core/runtime/cvel_mutex.h"
+#include "core/runtime/cvel_status.h"
+
+namespace tvel_internal {
+
+// The queue's invariants guard against programming errors: they stop the process in every build.
+inline void Check(bool holds, const char* text) {
+  if (!holds) {
+    std::fprintf(stderr, "Assertion failed: %s\n", text);
+    std::abort();
+  }
+}
+
+}  // namespace tvel_internal
+
+template <typename T>
+class TvelQueue {
+ public:
+  // The ceiling of the default queue; a queue never grows past its construction capacity.
+  static constexpr unsigned long kMaxItems = 2048;
+
+  TvelQueue() : TvelQueue(kMaxItems) {}
+  // An allocation failure leaves capacity 0: the queue then counts as full for ever.
+  explicit TvelQueue(unsigned long capacity)
+      : v_items(new (std::nothrow) T[capacity]),
+        v_currentmaxitem(v_items != nullptr ? capacity : 0) {
+    // A queue without room is full from the start, so producers sleep instead of spinning.
+    if (v_currentmaxitem == 0) {
+      v_notfull.Reset();
+    }
+  }
+
+  // Frees the array under the queue mutex. Queued items are dropped, not deleted.
+  ~TvelQueue() {
+    CvelMutexLock lock(v_queuemutex);
+    Flush();
+    v_items.reset();
+  }
+
+  TvelQueue(const TvelQueue&) = delete;
+  TvelQueue& operator=(const TvelQueue&) = delete;
+
+  // Copies item in, waiting as long as the queue is full: 0, or an event or mutex status.
+  long Put(const T& item) {
+    for (;;) {
+      long status = v_notfull.Wait();
+      bool stored = false;
+      if (status == cvel::kOk) {
+        CvelMutexLock lock(v_queuemutex);
+        if (!IsFull()) {
+          status = PutImpl(item);
+          stored = true;
+        } else {
+          tvel_internal::Check(v_numofitems.load() == v_currentmaxitem,
+                               "v_numofitems == v_currentmaxitem");
+        }
+      }
+      if (status != cvel::kOk || stored) {
+        return status;
+      }
+    }
+  }
+
+  // Takes the oldest item, waiting at most timeout_millis for one (whole seconds, so up to one
+  // second less): 0, -132 on timeout with item untouched, or another event status.
+  long Get(T& item, long timeout_millis) {
+    for (;;) {
+      const long status = v_notempty.Wait(timeout_millis);
+      if (status != cvel::kOk) {
+        return status;
+      }
+      CvelMutexLock lock(v_queuemutex);
+      if (!IsEmpty()) {
+        GetImpl(item);
+        return cvel::kOk;
+      }
+    }
+  }
+
+  bool IsFull() const { return v_numofitems.load(std::memory_order_relaxed) == v_currentmaxitem; }
+  bool IsEmpty() const { return v_numofitems.load(std::memory_order_relaxed) == 0; }
+
+  // Rewinds the indices and wakes producers without touching the count. Only the destructor may
+  // call it: the queue is inconsistent afterwards.
+  void Flush() {
+    v_head = 0;
+    v_tail = 0;
+    v_notfull.Signal();
+    v_notempty.Reset();
+  }
+
+ private:
+  // Requires v_queuemutex.
+  long PutImpl(const T& item) {
+    tvel_internal::Check(v_numofitems.load() < v_currentmaxitem, "v_numofitems < v_currentmaxitem");
+    v_tail = static_cast<long>((static_cast<unsigned long>(v_tail + 1)) % v_currentmaxitem);
+    v_items[v_tail] = item;
+    const unsigned long count = v_numofitems.load() + 1;
+    v_numofitems.store(count);
+    long status = v_notempty.Signal();
+    if (count == v_currentmaxitem) {
+      status = v_notfull.Reset();
+    }
+    return status;
+  }
+
+  // Requires v_queuemutex and a non-empty queue.
+  void GetImpl(T& item) {
+    item = v_items[v_head];
+    v_head = (v_head + 1) % v_currentmaxitem;
+    const unsigned long count = v_numofitems.load() - 1;
+    v_numofitems.store(count);
+    if (count == 0) {
+      v_notempty.Reset();
+    }
+    v_notfull.Signal();  // every blocked producer wakes and re-checks under the mutex
+  }
+
+  // Items queued; written under v_queuemutex, read unlocked by IsFull/IsEmpty.
+  std::atomic<unsigned long> v_numofitems{0};
+  std::unique_ptr<T[]> v_items;  // v_currentmaxitem slots; guarded by v_queuemutex
+  unsigned long v_head = 0;      // next slot to read; guarded by v_queuemutex
+  long v_tail = -1;              // last slot written; guarded by v_queuemutex
+  CvelEvent v_notempty{kEventManualReset, false};  // set while an item is queued
+  CvelEvent v_notfull{kEventManualReset, true};    // set while there is room
+  CvelMutex v_unusedmutex;                         // part of the queue's layout; nothing takes it
+  const unsigned long v_currentmaxitem;            // slots in v_items; 0 when allocation failed
+  CvelMutex v_queuemutex;  // guards the count's writes, the indices and the array
+};
