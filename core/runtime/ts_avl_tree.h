@@ -1,0 +1,45 @@
+#pragma once
+
+// TSAVLTree: an AVLTree whose operations that change or walk the tree hold one mutex.
+//
+// Locked for their whole run: addNode (with any trim it starts), removeNode (when lock is true),
+// findNode, getLarger, the dumps, markForDeletion, AddRef, Release and getRefCount.
+// Not locked: isTreeEmpty, getRoot, getSmaller, getSize, getMaxSize, getLRUNode, setMaxSize,
+// setRemoveCount, trimTreeByCount; callers that use these while other threads use the tree hold
+// their own lock around both. getSmaller stays unlocked while getLarger is locked, on purpose.
+//
+// Object pointers returned are used after the lock is gone: a reader that keeps one pins it
+// with AddRef and lets go with Release. Ownership is as for AVLTree. The mutex is not recursive;
+// the trim inside addNode removes through removeNode(object, false) so it is not taken twice.
+
+#include <cstdint>
+
+#include "core/runtime/avl_tree.h"
+#include "core/runtime/cvel_mutex.h"
+
+class TSAVLTree : public AVLTree {
+ public:
+  TSAVLTree();
+  explicit TSAVLTree(int mode);
+  TSAVLTree(int mode, bool allowDuplicates);
+  // Empties the tree under the lock. No other thread may start an operation once it runs.
+  ~TSAVLTree() override;
+
+  bool addNode(TreeNode* n) override;
+  // Takes the mutex only when lock is true; false is for callers that already hold it.
+  bool removeNode(TreeNode* key, bool lock) override;
+  bool removeNode(TreeNode* key) override;
+  TreeNode* findNode(TreeNode* key) override;
+  TreeNode* getLarger(TreeNode* key) override;
+  void dumpTree() override;
+  void dumpSortedTree() override;
+  void dumpATree(bool sorted, int* count, int* depth) override;
+
+  TreeNode* markForDeletion(TreeNode* key);
+  TreeNode* AddRef(TreeNode* key);
+  TreeNode* Release(TreeNode* key);
+  int32_t getRefCount(TreeNode* key);
+
+ private:
+  CvelMutex mutex;  // guards the structure, the recency list, the counts and size
+};
