@@ -7,6 +7,7 @@
 #   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/
 #   make asan / make tsan   sanitizer builds with their unit tests
 #   make test-tsan          the runtime primitives' tests under ThreadSanitizer
+#   make fuzz     clang libFuzzer build of the record parser, run for FUZZ_SECONDS (default 60)
 
 SHELL := /bin/bash
 BUILD_TYPE ?= RelWithDebInfo
@@ -22,7 +23,7 @@ DEPS := cmake ninja-build g++ make pkg-config git curl \
 
 SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
 
-.PHONY: all deps build test test-tsan demo bench install asan tsan clean format
+.PHONY: all deps build test test-tsan demo bench install asan tsan fuzz clean format
 
 all: build
 
@@ -69,6 +70,15 @@ bench: deps
 	cmake --build build-release -j $(JOBS)
 	@for b in build-release/bin/bench_*; do [ -x "$$b" ] && "$$b"; done; true
 
+FUZZ_SECONDS ?= 60
+fuzz: deps
+	cmake -S . -B build-fuzz $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+	  -DCMAKE_C_COMPILER=clang -DCMAKE_CXX_COMPILER=clang++ -DQ7_FUZZ=ON -DQ7_BUILD_TESTS=OFF
+	cmake --build build-fuzz -j $(JOBS) --target sm3_fuzz
+	mkdir -p build-fuzz/corpus
+	cd build-fuzz && bin/sm3_fuzz -max_total_time=$(FUZZ_SECONDS) -max_len=40000 \
+	  -print_final_stats=1 -dict=$(CURDIR)/tests/fuzz/sm3.dict corpus $(CURDIR)/tests/fuzz/seeds
+
 install: build
 	cmake --install build --prefix "$(PREFIX)"
 	PREFIX="$(PREFIX)" resources/install-home.sh
@@ -85,4 +95,4 @@ format:
 	clang-format -i $$(git ls-files '*.h' '*.cc')
 
 clean:
-	rm -rf build build-asan build-tsan build-release
+	rm -rf build build-asan build-tsan build-release build-fuzz

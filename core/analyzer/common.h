@@ -20,6 +20,10 @@ inline constexpr const char* COMMON_EOL_CHARS = "\n\r";
 // takes its power. A null text gives 0. Wraps silently past 32 bits.
 unsigned int ahextoi(const char* text);
 
+// A field of at most 16 characters read as strtol reads base 10 in the C locale: leading white
+// space, an optional sign, then digits up to the first non-digit; no digits give 0.
+long decimalFieldValue(const char* text);
+
 class CCommon {
  public:
   CCommon() = delete;

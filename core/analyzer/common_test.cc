@@ -196,3 +196,41 @@ TEST(FindFilesTest, ReverseReadingOrderOfMatches) {
 }
 
 }  // namespace
+
+namespace {
+
+// The integer reader agrees with strtol on every field a line can hold (16 characters at most).
+TEST(FieldTest, DecimalFieldValueAgreesWithStrtol) {
+  const std::string alphabet = "0123456789 \t\v+-x.9";
+  std::mt19937 rng(11);
+  for (int round = 0; round < 50000; ++round) {
+    std::string field;
+    const size_t length = rng() % 17;
+    for (size_t i = 0; i < length; ++i) {
+      field += alphabet[rng() % alphabet.size()];
+    }
+    ASSERT_EQ(strtol(field.c_str(), nullptr, 10), decimalFieldValue(field.c_str())) << field;
+  }
+  EXPECT_EQ(-9999999999999999L, decimalFieldValue("-9999999999999999"));
+}
+
+}  // namespace
+
+namespace {
+
+// The word-at-a-time caret count agrees with a plain count on texts of every length and mix,
+// bytes with the top bit set included.
+TEST(FieldTest, CaretCountAgreesWithPlainCount) {
+  const std::string alphabet = "^^^abc^\x7f\x80\xde\xfe~]_";
+  std::mt19937 rng(5);
+  for (int round = 0; round < 20000; ++round) {
+    std::string text;
+    const size_t length = rng() % 70;
+    for (size_t i = 0; i < length; ++i) {
+      text += alphabet[rng() % alphabet.size()];
+    }
+    ASSERT_EQ(std::count(text.begin(), text.end(), '^'), CCommon::countCarets(text.data())) << text;
+  }
+}
+
+}  // namespace

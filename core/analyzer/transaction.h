@@ -92,9 +92,9 @@ class CTransaction {
   char currentUUID_[kUUIDTextWidth];  // this record's own identifier
   int64_t instanceRoot_;              // tells occurrences of one current UUID apart
   int32_t importance_;
-  int32_t minThreshold_;  // response-time threshold, ms
-  int32_t reserved_;      // kept for the record layout; unused
-  int32_t controlFlags_;  // TRANSACTION_CONTROL_*
+  int32_t minThreshold_;               // response-time threshold, ms
+  [[maybe_unused]] int32_t reserved_;  // kept for the record layout; unused
+  int32_t controlFlags_;               // TRANSACTION_CONTROL_*
   int32_t trueTransType_;
   int32_t aggBy_;  // which own identities aggregation kept (1 application, 2 client, 4 transaction)
   char clientIPv6Address_[kTransactionNameWidth];
