@@ -234,19 +234,19 @@ bool DirectoryExists(const std::string& path, std::string* reason) {
 
 }  // namespace
 
-int TraceConfigure(std::string_view spec, std::string* error) {
+int TraceConfigure(std::string_view masks, std::string* error) {
   auto table = std::make_unique<MaskTable>();
   std::size_t pos = 0;
-  while (pos < spec.size()) {
-    if (IsBlank(spec[pos])) {
+  while (pos < masks.size()) {
+    if (IsBlank(masks[pos])) {
       ++pos;
       continue;
     }
     std::size_t end = pos;
-    while (end < spec.size() && !IsBlank(spec[end])) {
+    while (end < masks.size() && !IsBlank(masks[end])) {
       ++end;
     }
-    const std::string_view word = spec.substr(pos, end - pos);
+    const std::string_view word = masks.substr(pos, end - pos);
     pos = end;
 
     const std::size_t eq = word.find('=');
@@ -440,10 +440,10 @@ TraceFlowScope::~TraceFlowScope() {
   TraceEvent(unit_, false, func_, {});
 }
 
-TraceCapture::TraceCapture(std::string_view spec) : previous_masks_(TraceMasksText()) {
+TraceCapture::TraceCapture(std::string_view masks) : previous_masks_(TraceMasksText()) {
   std::string error;
-  const int rc = TraceConfigure(spec, &error);
-  assert(rc == kOk && "TraceCapture needs a valid trace spec");
+  const int rc = TraceConfigure(masks, &error);
+  assert(rc == kOk && "TraceCapture needs valid trace masks");
   (void)rc;
   Writer& writer = GetWriter();
   std::lock_guard<std::mutex> lock(writer.mu);

@@ -34,7 +34,7 @@ inline constexpr unsigned kTraceAll = 0xFF;
 // names are matched in any case; a number above 0xFF is a syntax error. On a syntax error returns
 // kParseError, sets *error to a message naming the bad word (when error is non-null) and keeps the
 // previous masks.
-int TraceConfigure(std::string_view spec, std::string* error);
+int TraceConfigure(std::string_view masks, std::string* error);
 
 // Directs records to "path": "-" means standard error, anything else a file rotated at
 // max_bytes, keeping max_files old files. The file's directory must exist. Returns kOk or

@@ -1,7 +1,7 @@
 #pragma once
 
 // Test helper: while alive, every trace record is also kept in memory (formatted as in the
-// trace file, without the time stamp), and the masks are set to the given spec. The previous
+// trace file, without the time stamp), and the masks are set to the given ones. The previous
 // masks come back on destruction. One capture at a time.
 
 #include <string>
@@ -12,7 +12,7 @@ namespace fw {
 
 class TraceCapture {
  public:
-  explicit TraceCapture(std::string_view spec = "*=ALL");
+  explicit TraceCapture(std::string_view masks = "*=ALL");
   ~TraceCapture();
   TraceCapture(const TraceCapture&) = delete;
   TraceCapture& operator=(const TraceCapture&) = delete;

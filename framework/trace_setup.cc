@@ -20,10 +20,10 @@ std::string g_destination = "-";  // guarded by g_mutex
 
 int StartTracing(std::string* error) {
   int status = kOk;
-  std::string spec;
-  if (GetEnv("Q7_TRACE", &spec)) {
+  std::string masks;
+  if (GetEnv("Q7_TRACE", &masks)) {
     std::string why;
-    if (TraceConfigure(spec, &why) != kOk) {
+    if (TraceConfigure(masks, &why) != kOk) {
       *error = "Q7_TRACE ignored: " + why;
       status = kParseError;
     }

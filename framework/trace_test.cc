@@ -25,9 +25,9 @@ class TraceMaskTest : public ::testing::Test {
   void SetUp() override { saved_ = TraceMasksText(); }
   void TearDown() override { ASSERT_EQ(kOk, TraceConfigure(saved_, nullptr)); }
 
-  void Configure(std::string_view spec) {
+  void Configure(std::string_view masks) {
     std::string error;
-    ASSERT_EQ(kOk, TraceConfigure(spec, &error)) << error;
+    ASSERT_EQ(kOk, TraceConfigure(masks, &error)) << error;
   }
 
  private:
