@@ -1,0 +1,67 @@
+// The aggregate row's two hot operations: adding one transaction to an over-time row (done for
+// seven tables per page) and folding one exported over-time row into a summary row (done for
+// every history row a summary query reads), plus the copy into a table row.
+
+#include <benchmark/benchmark.h>
+
+#include <cstdio>
+
+#include "core/analyzer/rows/rows.h"
+
+namespace {
+
+CDPXTransaction Transaction() {
+  SM3_HPAGE_ENTRY e{};
+  e.iTotalResponseTime = 230;
+  e.iServerTime = 80;
+  e.iNetworkTime = 40;
+  e.iRequestStatus = 200;
+  e.iLoadTime = 120;
+  snprintf(e.szURLHostName, sizeof(e.szURLHostName), "www.shop.example");
+  snprintf(e.szURL, sizeof(e.szURL), "/shop/catalog/items/index.jsp");
+  snprintf(e.szIPSourceAddress, sizeof(e.szIPSourceAddress), "10.1.2.3");
+  snprintf(e.szIPDestinationAddress, sizeof(e.szIPDestinationAddress), "192.0.2.10");
+  CDPXTransaction t(e);
+  t.setMinThreshold(500);
+  return t;
+}
+
+void BM_RowUpdate(benchmark::State& state) {
+  CDPXTransaction t = Transaction();
+  CTransactionOverTime row(t);
+  for (auto _ : state) {
+    row.Update(t);
+    benchmark::DoNotOptimize(row.getCommon().totreq);
+  }
+}
+BENCHMARK(BM_RowUpdate);
+
+void BM_SummaryFold(benchmark::State& state) {
+  CDPXTransaction t = Transaction();
+  CTransactionOverTime row(t);
+  for (int i = 0; i < 50; ++i) {
+    row.Update(t);
+  }
+  kq7_q7txot_data_t layout;
+  row.getQ7Struct(layout);
+  CTransactionSummary summary(layout);
+  for (auto _ : state) {
+    summary.Update(layout);
+    benchmark::DoNotOptimize(summary.getCommon().totreq);
+  }
+}
+BENCHMARK(BM_SummaryFold);
+
+void BM_TableRowCopy(benchmark::State& state) {
+  CDPXTransaction t = Transaction();
+  CTransactionOverTime row(t);
+  row.Update(t);
+  kq7_q7txot_data_t layout;
+  for (auto _ : state) {
+    row.getQ7Struct(layout);
+    benchmark::DoNotOptimize(layout.totreq);
+  }
+}
+BENCHMARK(BM_TableRowCopy);
+
+}  // namespace

@@ -1,0 +1,73 @@
+#pragma once
+
+// The sixteen row classes: eight over-time rows (one key in one interval, fed transaction by
+// transaction) and eight summary rows (one key over the summary period, folded from exported
+// over-time rows). Each is its key (fields in storage order, and the order its tree sorts by)
+// and its layouts; rows/keyed_row.h does the rest.
+//
+// The over-time and summary sort orders differ on purpose for the client/application,
+// server/application and transaction rows. CClientAppSummary labels its client "ClientNAme".
+//
+// Threads and ownership as CBaseTable: rows live in the analyzer's trees, which own them.
+
+#include "core/analyzer/rows/keyed_row.h"
+
+namespace rows {
+
+using K = Key;
+
+// Storage order first; then the sort order as indexes into it.
+inline constexpr KeySpec<1> kApplicationKeys{{K::kApplication}, {0}};
+inline constexpr KeySpec<2> kClientAppOverTimeKeys{{K::kApplication, K::kClient}, {0, 1}};
+inline constexpr KeySpec<2> kClientAppSummaryKeys{
+    {K::kApplication, K::kClient}, {1, 0}, "ClientNAme=%s\n"};
+inline constexpr KeySpec<2> kServerAppOverTimeKeys{{K::kApplication, K::kServer}, {0, 1}};
+inline constexpr KeySpec<2> kServerAppSummaryKeys{{K::kApplication, K::kServer}, {1, 0}};
+inline constexpr KeySpec<4> kTransactionOverTimeKeys{
+    {K::kApplication, K::kServer, K::kClient, K::kTransaction}, {3, 0, 2, 1}};
+inline constexpr KeySpec<4> kTransactionSummaryKeys{
+    {K::kApplication, K::kServer, K::kClient, K::kTransaction}, {0, 1, 3, 2}};
+inline constexpr KeySpec<3> kSubTransactionKeys{{K::kTransaction, K::kParentId, K::kCurrentId},
+                                                {1, 2, 0}};
+inline constexpr KeySpec<3> kClientKeys{{K::kClient, K::kClientIP, K::kHostname}, {1, 2, 0}};
+inline constexpr KeySpec<2> kClientServerKeys{{K::kClient, K::kServer}, {1, 0}};
+inline constexpr KeySpec<2> kServerKeys{{K::kServer, K::kServerIP}, {0, 1}};
+
+}  // namespace rows
+
+#define Q7_OVER_TIME_ROW(Name, keys, layout)                   \
+  class Name final : public rows::TOverTimeRow<keys, layout> { \
+   public:                                                     \
+    using rows::TOverTimeRow<keys, layout>::TOverTimeRow;      \
+  };
+#define Q7_SUMMARY_ROW(Name, keys, overTime, layout)                    \
+  class Name final : public rows::TSummaryRow<keys, overTime, layout> { \
+   public:                                                              \
+    using rows::TSummaryRow<keys, overTime, layout>::TSummaryRow;       \
+  };
+
+Q7_OVER_TIME_ROW(CApplicationOverTime, rows::kApplicationKeys, kq7_q7appot_data_t)
+Q7_OVER_TIME_ROW(CClientAppOverTime, rows::kClientAppOverTimeKeys, kq7_q7clntappot_data_t)
+Q7_OVER_TIME_ROW(CServerAppOverTime, rows::kServerAppOverTimeKeys, kq7_q7srvappot_data_t)
+Q7_OVER_TIME_ROW(CTransactionOverTime, rows::kTransactionOverTimeKeys, kq7_q7txot_data_t)
+Q7_OVER_TIME_ROW(CSubTransactionOverTime, rows::kSubTransactionKeys, kq7_q7subtxot_data_t)
+Q7_OVER_TIME_ROW(CClientOverTime, rows::kClientKeys, kq7_q7clntot_data_t)
+Q7_OVER_TIME_ROW(CClientServerOverTime, rows::kClientServerKeys, kq7_q7clntsrvot_data_t)
+Q7_OVER_TIME_ROW(CServerOverTime, rows::kServerKeys, kq7_q7srvot_data_t)
+
+Q7_SUMMARY_ROW(CApplicationSummary, rows::kApplicationKeys, kq7_q7appot_data_t, kq7_q7appsm_data_t)
+Q7_SUMMARY_ROW(CClientAppSummary, rows::kClientAppSummaryKeys, kq7_q7clntappot_data_t,
+               kq7_q7clntapp_data_t)
+Q7_SUMMARY_ROW(CServerAppSummary, rows::kServerAppSummaryKeys, kq7_q7srvappot_data_t,
+               kq7_q7srvappsm_data_t)
+Q7_SUMMARY_ROW(CTransactionSummary, rows::kTransactionSummaryKeys, kq7_q7txot_data_t,
+               kq7_q7txsm_data_t)
+Q7_SUMMARY_ROW(CSubTransactionSummary, rows::kSubTransactionKeys, kq7_q7subtxot_data_t,
+               kq7_q7subtxsm_data_t)
+Q7_SUMMARY_ROW(CClientSummary, rows::kClientKeys, kq7_q7clntot_data_t, kq7_q7clntsm_data_t)
+Q7_SUMMARY_ROW(CClientServerSummary, rows::kClientServerKeys, kq7_q7clntsrvot_data_t,
+               kq7_q7clntsrv_data_t)
+Q7_SUMMARY_ROW(CServerSummary, rows::kServerKeys, kq7_q7srvot_data_t, kq7_q7srvsm_data_t)
+
+#undef Q7_SUMMARY_ROW
+#undef Q7_OVER_TIME_ROW
