@@ -12,6 +12,7 @@
 #include "framework/agent_runtime.h"
 #include "framework/runtime_state.h"
 #include "framework/status.h"
+#include "framework/tables.h"
 #include "framework/trace.h"
 
 namespace fw {
@@ -65,6 +66,21 @@ nlohmann::json Health() {
     provider(health);
   }
   return health;
+}
+
+nlohmann::json Tables() {
+  nlohmann::json tables = nlohmann::json::array();
+  for (const auto& table : ListTables()) {
+    nlohmann::json columns = nlohmann::json::array();
+    for (const ColumnInfo& column : table->columns) {
+      columns.push_back({{"name", column.name},
+                         {"type", column.type},
+                         {"width", column.width},
+                         {"offset", column.offset}});
+    }
+    tables.push_back({{"name", table->name}, {"columns", std::move(columns)}});
+  }
+  return nlohmann::json{{"tables", std::move(tables)}};
 }
 
 }  // namespace
@@ -134,6 +150,8 @@ void HttpServer::InstallRoutes() {
         [](const httplib::Request&, httplib::Response& res) { ReplyJson(res, 200, Health()); });
   s.Get("/api/v1/agent",
         [](const httplib::Request&, httplib::Response& res) { ReplyJson(res, 200, AgentInfo()); });
+  s.Get("/api/v1/tables",
+        [](const httplib::Request&, httplib::Response& res) { ReplyJson(res, 200, Tables()); });
 }
 
 int HttpServer::Start(const std::string& address, std::string* error) {

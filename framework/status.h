@@ -10,5 +10,6 @@ inline constexpr int kIoError = -2;          // a file or socket operation faile
 inline constexpr int kParseError = -3;       // text did not have the expected syntax
 inline constexpr int kInvalidArgument = -4;  // a caller passed something unusable
 inline constexpr int kAlreadyRunning = -5;   // a start was requested twice
+inline constexpr int kAlreadyExists = -6;    // a name is already registered
 
 }  // namespace fw

@@ -45,4 +45,8 @@ int InitAllTables() {
   return initialised;
 }
 
+void ResetTableInitsForTesting() {
+  Inits().fill(nullptr);
+}
+
 }  // namespace q7tema

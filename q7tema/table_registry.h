@@ -29,4 +29,7 @@ bool RegisterTableInit(std::string_view name, TableInitFunction init);
 // each table without an init function leaves one summary trace line.
 int InitAllTables();
 
+// Forgets every init function (tests only).
+void ResetTableInitsForTesting();
+
 }  // namespace q7tema

@@ -14,7 +14,9 @@
 #include <vector>
 
 #include "framework/agent_runtime.h"
+#include "framework/tables.h"
 #include "framework/trace_capture.h"
+#include "q7tema/table_registry.h"
 #include "tama/agent_globals.h"
 #include "tama/agent_hooks.h"
 #include "tama/ct_main.h"
@@ -80,9 +82,17 @@ TEST_F(StartupTest, MessageFileNameFromEnvironment) {
   unsetenv("KQ7_MSG_FILE_NAME");
 }
 
-// The loader declares the five affinities in order; every KQ7 command is acknowledged.
+// The loader declares the five affinities in order and registers the tables in load order;
+// every KQ7 command is acknowledged.
 TEST_F(StartupTest, LoaderAndCommandCallback) {
+  fw::ResetTablesForTesting();
   EXPECT_EQ(0, LoadAgents());
+  const auto tables = fw::ListTables();
+  ASSERT_EQ(23u, tables.size());
+  EXPECT_EQ("Q7AGNTDTS", tables.front()->name);
+  EXPECT_EQ("Q7SUBTXINS", tables.back()->name);
+  fw::ResetTablesForTesting();
+  q7tema::ResetTableInitsForTesting();
   const std::vector<std::string> expected{"AFF_FEAT_DM_PARITY", "AFF_FEAT_AGENT_MGMT",
                                           "AFF_FEAT_INTERNATIONALIZATION", "AFF_V1",
                                           "0000000000000000000100000000000000000000000"};

@@ -10,6 +10,7 @@
 #include <filesystem>
 #include <nlohmann/json.hpp>
 #include <string>
+#include <vector>
 
 #include "tests/agent_process.h"
 
@@ -142,6 +143,44 @@ TEST_F(AgentE2ETest, StartsServesAndStopsOnSigterm) {
   EXPECT_LT(received, waiting);
   EXPECT_LT(waiting, completed);
   EXPECT_FALSE(std::filesystem::exists(home_.path() + "logs/q7agent.addr"));
+}
+
+// The loader registers the 23 exported tables in load order; the API lists them with their
+// columns.
+TEST_F(AgentE2ETest, ListsTheTablesInLoadOrder) {
+  const std::string address = start();
+  int status = 0;
+  const nlohmann::json body = get(address, "/api/v1/tables", &status);
+  EXPECT_EQ(200, status);
+  const std::vector<std::string> expected{
+      "Q7AGNTDTS",  "Q7AGNTMSGS", "Q7APPOT",   "Q7APPSM",    "Q7CLNTAPP", "Q7CLNTOT",
+      "Q7CLNTPTNS", "Q7CLNTSM",   "Q7CLNTSRV", "Q7SRVAPPSM", "Q7SRVOT",   "Q7SRVSM",
+      "Q7TXINS",    "Q7TXOT",     "Q7TXPTNS",  "Q7TXSM",     "Q7TXCS",    "Q7APPCS",
+      "Q7CLNTCS",   "Q7SRVCS",    "Q7SUBTXSM", "Q7SUBTXOT",  "Q7SUBTXINS"};
+  std::vector<std::string> names;
+  for (const auto& table : body["tables"]) {
+    names.push_back(table.value("name", ""));
+    EXPECT_FALSE(table["columns"].empty()) << names.back();
+  }
+  EXPECT_EQ(expected, names);
+  ASSERT_EQ(expected.size(), body["tables"].size());
+
+  const nlohmann::json& agntdts = body["tables"][0]["columns"];
+  EXPECT_EQ(nlohmann::json::parse(R"({"name": "originnode", "type": 9, "width": 32, "offset": 0})"),
+            agntdts[0]);
+  EXPECT_EQ(5u, agntdts.size());
+  const nlohmann::json& appot = body["tables"][2]["columns"];
+  EXPECT_EQ(
+      nlohmann::json::parse(R"({"name": "importance", "type": 5, "width": 2, "offset": 128})"),
+      appot[1]);
+  EXPECT_EQ(nlohmann::json::parse(R"({"name": "dintval", "type": 3, "width": 4, "offset": 180})"),
+            appot[4]);
+  const nlohmann::json& agntmsgs = body["tables"][1]["columns"];
+  EXPECT_EQ(
+      nlohmann::json::parse(R"({"name": "msgtext", "type": 12, "width": 1024, "offset": 132})"),
+      agntmsgs[6]);
+  stopWith(SIGTERM);
+  EXPECT_EQ(std::string::npos, trace().find("refused")) << trace();
 }
 
 // SIGINT stops the agent just as SIGTERM does.
