@@ -313,3 +313,51 @@ TEST_F(RowTest, OverTimeRowsRoundTripThroughTheirLayouts) {
 }
 
 }  // namespace
+
+namespace {
+
+// The trace forms of the blocks, appended to what the buffer holds.
+TEST(RowArithmeticTest, DumpTexts) {
+  common_data_t c{};
+  c.dintval = 300;
+  c.totreq = 2;
+  c.oatime = 250;
+  char buffer[1024] = "row: ";
+  EXPECT_STREQ(
+      "row: common_data_t {, dintval=300, pcfail=0, pcslow=0, pcgood=0, pcavail=0, oatime=250, "
+      "succreq=0, failreq=0, totreq=2, slowreq=0, mtrthres=0, minrtt=0, mmaxrtt=0 };\n",
+      dumpCommonData(c, buffer));
+  carm_data_t a{};
+  a.totcntt = 7;
+  buffer[0] = '\0';
+  EXPECT_STREQ("carm_data_t {totcntt=7, totdnst=0, totrslvt=0, totsvrrt=0}; ",
+               dumpARMData(a, buffer));
+  lyn_data_t l{};
+  buffer[0] = '\0';
+  EXPECT_STREQ("lyn_data_t { conncttime=0, dwnldtime=0, brwsrcon=0, conntime=0, avdwnldtm=0} ",
+               dumpLYNData(l, buffer));
+  dpx_data_t d{};
+  d.num404 = 3;
+  buffer[0] = '\0';
+  EXPECT_NE(nullptr, strstr(dumpDPXData(d, buffer), "num403=0, num404=3, num500=0};\n"));
+}
+
+// Client-side rows count browser transactions and keep their connect and download sums only
+// while there are any.
+TEST(RowArithmeticTest, ClientSideData) {
+  lyn_data_t data{};
+  CLYNTransaction quiet;
+  updateLYNData(quiet, data, 1);
+  EXPECT_EQ(0, data.brwsrcon);
+  CLYNTransaction browser;
+  browser.connectTime = 5;
+  browser.downloadTime = 20;
+  browser.setTrueTransType(TRUE_TRANS_TYPE_LYN_BROWSER);
+  updateLYNData(browser, data, 2);
+  EXPECT_EQ(1, data.brwsrcon);
+  EXPECT_EQ(5, data.conntime);
+  EXPECT_EQ(20, data.avdwnldtm);
+  EXPECT_TRUE(data.browserType);
+}
+
+}  // namespace
