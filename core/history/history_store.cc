@@ -1,0 +1,215 @@
+#include "core/history/history_store.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <filesystem>
+#include <optional>
+#include <system_error>
+#include <utility>
+
+#include "core/history/file_io.h"
+#include "core/history/history_file_name.h"
+#include "core/runtime/clog.h"
+
+namespace history {
+
+namespace {
+
+// An open history file and the number of whole records it holds.
+struct RecordFile {
+  UniqueFd fd;
+  size_t records = 0;
+};
+
+// Opens a file for reading its records. A missing file is an empty one, silently; other
+// failures and a trailing partial record are traced with `where` and the path.
+RecordFile OpenRecords(const std::string& path, size_t record_size, const char* where) {
+  RecordFile file;
+  file.fd.reset(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  if (!file.fd.valid()) {
+    if (errno != ENOENT) {
+      CLOG::error("%s cannot open %s: %s", where, path.c_str(), std::strerror(errno));
+    }
+    return file;
+  }
+  const off_t size = FileSize(file.fd.get());
+  if (size < 0) {
+    CLOG::error("%s cannot examine %s: %s", where, path.c_str(), std::strerror(errno));
+    file.fd.reset();
+    return file;
+  }
+  const size_t bytes = static_cast<size_t>(size);
+  file.records = bytes / record_size;
+  if (bytes % record_size != 0) {
+    CLOG::error(
+        "%s %s holds %zu bytes, not a whole number of %zu-byte records; ignoring the last %zu",
+        where, path.c_str(), bytes, record_size, bytes % record_size);
+  }
+  return file;
+}
+
+// Reads up to max_records whole records from the start of an open file; returns how many.
+size_t ReadRecords(const RecordFile& file, size_t record_size, size_t max_records, std::byte* out,
+                   const std::string& path, const char* where) {
+  const size_t wanted = std::min(file.records, max_records);
+  if (wanted == 0) {
+    return 0;
+  }
+  const ssize_t got = ReadAt(file.fd.get(), out, wanted * record_size, 0);
+  if (got < 0) {
+    CLOG::error("%s cannot read %s: %s", where, path.c_str(), std::strerror(errno));
+    return 0;
+  }
+  // The file may have shrunk since it was measured; only whole records count.
+  return static_cast<size_t>(got) / record_size;
+}
+
+// False when a read over `intervals` intervals has nothing to do; nonsense arguments are traced.
+bool ValidWalk(int intervals, int64_t interval_seconds, size_t record_size, const char* where) {
+  if (record_size == 0) {
+    CLOG::error("%s record size 0", where);
+    return false;
+  }
+  if (intervals > 1 && interval_seconds <= 0) {
+    CLOG::error("%s interval length %lld over %d intervals", where,
+                static_cast<long long>(interval_seconds), intervals);
+    return false;
+  }
+  return intervals > 0;
+}
+
+}  // namespace
+
+HistoryStore::HistoryStore(std::string directory) : directory_(std::move(directory)) {
+  while (directory_.size() > 1 && directory_.back() == '/') {
+    directory_.pop_back();
+  }
+}
+
+std::string HistoryStore::pathOf(int64_t interval, std::string_view stem) const {
+  return directory_ + "/" + IntervalFileName(interval, stem);
+}
+
+bool HistoryStore::saveInterval(int64_t interval, std::string_view stem, const void* records,
+                                size_t record_size, size_t count) const {
+  static const char* const kWhere = "HistoryStore::saveInterval";
+  if (interval < 0) {
+    CLOG::error("%s negative interval start %lld for %.*s", kWhere,
+                static_cast<long long>(interval), static_cast<int>(stem.size()), stem.data());
+    return false;
+  }
+  const std::string path = pathOf(interval, stem);
+  if (count == 0) {
+    if (::unlink(path.c_str()) != 0 && errno != ENOENT) {
+      CLOG::error("%s cannot remove %s: %s", kWhere, path.c_str(), std::strerror(errno));
+      return false;
+    }
+    return true;
+  }
+  const std::string temp = directory_ + "/" + TemporaryFileName(interval, stem);
+  if (!ReplaceFileContents(path, temp, records, record_size * count)) {
+    CLOG::error("%s cannot write %s: %s", kWhere, path.c_str(), std::strerror(errno));
+    return false;
+  }
+  CLOG::med("%s wrote %zu records to %s", kWhere, count, path.c_str());
+  return true;
+}
+
+size_t HistoryStore::countRows(std::string_view stem, int64_t last_interval, int intervals,
+                               int64_t interval_seconds, size_t record_size) const {
+  static const char* const kWhere = "HistoryStore::countRows";
+  if (!ValidWalk(intervals, interval_seconds, record_size, kWhere)) {
+    return 0;
+  }
+  size_t total = 0;
+  for (int i = 0; i < intervals; ++i) {
+    const int64_t start = last_interval - i * interval_seconds;
+    if (start < 0) {
+      break;
+    }
+    total += OpenRecords(pathOf(start, stem), record_size, kWhere).records;
+  }
+  return total;
+}
+
+size_t HistoryStore::loadRows(std::string_view stem, int64_t last_interval, int intervals,
+                              int64_t interval_seconds, size_t record_size, size_t max_rows,
+                              void* out) const {
+  static const char* const kWhere = "HistoryStore::loadRows";
+  if (!ValidWalk(intervals, interval_seconds, record_size, kWhere)) {
+    return 0;
+  }
+  std::byte* next = static_cast<std::byte*>(out);
+  size_t loaded = 0;
+  for (int i = 0; i < intervals && loaded < max_rows; ++i) {
+    const int64_t start = last_interval - i * interval_seconds;
+    if (start < 0) {
+      break;
+    }
+    const std::string path = pathOf(start, stem);
+    const RecordFile file = OpenRecords(path, record_size, kWhere);
+    const size_t got = ReadRecords(file, record_size, max_rows - loaded, next, path, kWhere);
+    loaded += got;
+    next += got * record_size;
+  }
+  return loaded;
+}
+
+std::vector<std::byte> HistoryStore::loadInterval(int64_t interval, std::string_view stem,
+                                                  size_t record_size) const {
+  static const char* const kWhere = "HistoryStore::loadInterval";
+  std::vector<std::byte> records;
+  if (!ValidWalk(1, 0, record_size, kWhere)) {
+    return records;
+  }
+  const std::string path = pathOf(interval, stem);
+  const RecordFile file = OpenRecords(path, record_size, kWhere);
+  records.resize(file.records * record_size);
+  const size_t got = ReadRecords(file, record_size, file.records, records.data(), path, kWhere);
+  records.resize(got * record_size);
+  return records;
+}
+
+int HistoryStore::cleanupOldFiles(int64_t now, int64_t summary_seconds) const {
+  static const char* const kWhere = "HistoryStore::cleanupOldFiles";
+  namespace fs = std::filesystem;
+  const int64_t oldest_kept = now - summary_seconds;
+  int removed = 0;
+  std::error_code ec;
+  fs::directory_iterator it(directory_, ec);
+  if (ec) {
+    if (ec != std::errc::no_such_file_or_directory) {
+      CLOG::error("%s cannot list %s: %s", kWhere, directory_.c_str(), ec.message().c_str());
+    }
+    return 0;
+  }
+  for (; !ec && it != fs::directory_iterator(); it.increment(ec)) {
+    const std::string name = it->path().filename().string();
+    const std::optional<int64_t> start = IntervalOfStoreFile(name);
+    if (!start || *start >= oldest_kept) {
+      continue;
+    }
+    // A directory or link that happens to carry such a name is not ours.
+    std::error_code type_ec;
+    if (it->symlink_status(type_ec).type() != fs::file_type::regular) {
+      continue;
+    }
+    const std::string path = it->path().string();
+    if (::unlink(path.c_str()) != 0) {
+      CLOG::error("%s cannot remove %s: %s", kWhere, path.c_str(), std::strerror(errno));
+      continue;
+    }
+    CLOG::med("%s removed %s", kWhere, path.c_str());
+    ++removed;
+  }
+  if (ec) {
+    CLOG::error("%s listing %s stopped: %s", kWhere, directory_.c_str(), ec.message().c_str());
+  }
+  return removed;
+}
+
+}  // namespace history
