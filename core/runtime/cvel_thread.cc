@@ -58,6 +58,15 @@ CvelThread::~CvelThread() {
   if (state_.load() == kStateNotInitialized || released_.exchange(true)) {
     return;
   }
+  // A thread that was never started waits on the start event, which dies with this object:
+  // wake it to end without running the body, and reap it.
+  int expected = kStateCreated;
+  if (state_.compare_exchange_strong(expected, kStateFinished)) {
+    abandoned_.store(true);
+    start_event_.Signal();
+    pthread_join(id_, nullptr);
+    return;
+  }
   // A body that has returned leaves only a few instructions to run, so reaping it does not wait
   // on Run; anything else (still running, or terminated) is left to finish on its own.
   if (body_returned_.load()) {
@@ -72,6 +81,11 @@ void* CvelThread::StartRoutine(void* arg) {
   CvelErrorManager::RegisterThread();
   CvelThreadLibrary::SetThreadName(self->name_);
   self->start_event_.Wait();
+  if (self->abandoned_.load()) {
+    CvelThreadLibrary::SetThreadName(nullptr);
+    CvelErrorManager::UnregisterThread();
+    return nullptr;
+  }
   Q7_TRACE(kUnit, fw::kTraceDetail, "thread \"%s\" running", self->name_);
   self->Run();
   Q7_TRACE(kUnit, fw::kTraceDetail, "thread \"%s\" finished", self->name_);

@@ -88,4 +88,7 @@ class CvelThread {
   std::atomic<bool> released_{false};
   // Set by the started thread once Run has returned (unlike state 2, which Terminate also sets).
   std::atomic<bool> body_returned_{false};
+  // Set by the destructor of a thread that was never started: the thread wakes and ends
+  // without running the body.
+  std::atomic<bool> abandoned_{false};
 };

@@ -3,6 +3,7 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <string>
 
 #include "core/analyzer/dpx_transaction.h"
 #include "core/analyzer/other_transactions.h"
@@ -56,7 +57,14 @@ CBaseTable::CBaseTable()
       reservedLong(0),
       aggBy(0) {
   memset(&kindData, 0, sizeof(kindData));
-  TimeSince70ToMordel(0, timestamp);
+  // Rows are built for every lookup on the per-transaction path; the timestamp of time 0 is
+  // worked out once rather than through localtime each time.
+  static const std::string zero = [] {
+    char text[17] = {};
+    TimeSince70ToMordel(0, text);
+    return std::string(text, 16);
+  }();
+  memcpy(timestamp, zero.data(), 16);
   timestamp[16] = '\0';
 }
 

@@ -1,0 +1,129 @@
+#include "core/analyzer/analysis/over_time_trees.h"
+
+#include <cstring>
+
+#include "core/analyzer/rows/rows.h"
+#include "core/history/history_store.h"
+#include "core/runtime/clog.h"
+
+namespace {
+
+template <class Row>
+bool SaveTree(TSAVLTree& tree, history::HistoryStore& store, long interval, const char* stem) {
+  using Layout = typename Row::LayoutType;
+  std::vector<TreeNode*> nodes;
+  collectTreeNodes(tree, nodes);
+  std::vector<Layout> rows(nodes.size());
+  for (size_t i = 0; i < nodes.size(); ++i) {
+    static_cast<Row*>(nodes[i])->getQ7Struct(rows[i]);
+  }
+  return store.saveInterval(interval, stem, rows.data(), sizeof(Layout), rows.size());
+}
+
+template <class Row>
+void LoadTree(TSAVLTree& tree, history::HistoryStore& store, long interval, const char* stem) {
+  using Layout = typename Row::LayoutType;
+  const std::vector<std::byte> bytes = store.loadInterval(interval, stem, sizeof(Layout));
+  const size_t count = bytes.size() / sizeof(Layout);
+  for (size_t i = 0; i < count; ++i) {
+    Layout layout;
+    memcpy(&layout, bytes.data() + i * sizeof(Layout), sizeof(Layout));
+    auto row = std::make_unique<Row>(layout);
+    if (tree.addNode(row.get())) {
+      row.release();  // the tree owns it now
+    } else {
+      CLOG::min("%s duplicate row in the history of %s for interval[%ld] ignored",
+                "COverTimeTrees::load", stem, interval);
+    }
+  }
+}
+
+template <class Row>
+void SeedTree(TSAVLTree& tree, TSAVLTree& ended, long interval) {
+  using Layout = typename Row::LayoutType;
+  std::vector<TreeNode*> nodes;
+  collectTreeNodes(ended, nodes);
+  for (TreeNode* node : nodes) {
+    Layout layout;
+    static_cast<Row*>(node)->getQ7Struct(layout);
+    auto row = std::make_unique<Row>(layout);
+    row->reset(interval);
+    if (tree.addNode(row.get())) {
+      row.release();
+    }
+  }
+}
+
+struct TableOps {
+  const char* stem;
+  bool (*save)(TSAVLTree&, history::HistoryStore&, long, const char*);
+  void (*load)(TSAVLTree&, history::HistoryStore&, long, const char*);
+  void (*seed)(TSAVLTree&, TSAVLTree&, long);
+};
+
+template <class Row>
+constexpr TableOps Ops(const char* stem) {
+  return {stem, &SaveTree<Row>, &LoadTree<Row>, &SeedTree<Row>};
+}
+
+// In OverTimeTable order.
+constexpr TableOps kTables[kOverTimeTables] = {
+    Ops<CApplicationOverTime>("q7appot"),   Ops<CServerAppOverTime>("q7srvappot"),
+    Ops<CServerOverTime>("q7srvot"),        Ops<CClientServerOverTime>("q7clntsrvot"),
+    Ops<CClientOverTime>("q7clntot"),       Ops<CTransactionOverTime>("q7txot"),
+    Ops<CClientAppOverTime>("q7clntappot"), Ops<CSubTransactionOverTime>("q7subtxot"),
+};
+
+void Collect(AVLTree& tree, TreeNode* node, std::vector<TreeNode*>& nodes) {
+  if (node == nullptr) {
+    return;
+  }
+  Collect(tree, tree.getSmaller(node), nodes);
+  nodes.push_back(node);
+  Collect(tree, tree.getLarger(node), nodes);
+}
+
+}  // namespace
+
+const char* overTimeStem(OverTimeTable table) {
+  return kTables[static_cast<int>(table)].stem;
+}
+
+void collectTreeNodes(AVLTree& tree, std::vector<TreeNode*>& nodes) {
+  nodes.reserve(nodes.size() + static_cast<size_t>(tree.getSize()));
+  Collect(tree, tree.getRoot(), nodes);
+}
+
+COverTimeTrees::COverTimeTrees() {
+  for (auto& tree : trees_) {
+    tree = std::make_unique<TSAVLTree>(0, false);
+  }
+}
+
+long COverTimeTrees::totalRows() const {
+  long rows = 0;
+  for (const auto& tree : trees_) {
+    rows += tree->getSize();
+  }
+  return rows;
+}
+
+bool COverTimeTrees::save(history::HistoryStore& store, long interval) const {
+  bool saved = true;
+  for (int i = 0; i < kOverTimeTables; ++i) {
+    saved = kTables[i].save(*trees_[i], store, interval, kTables[i].stem) && saved;
+  }
+  return saved;
+}
+
+void COverTimeTrees::load(history::HistoryStore& store, long interval) {
+  for (int i = 0; i < kOverTimeTables; ++i) {
+    kTables[i].load(*trees_[i], store, interval, kTables[i].stem);
+  }
+}
+
+void COverTimeTrees::seedZeroRows(const COverTimeTrees& ended, long interval) {
+  for (int i = 0; i < kOverTimeTables; ++i) {
+    kTables[i].seed(*trees_[i], *ended.trees_[i], interval);
+  }
+}

@@ -1,0 +1,58 @@
+#pragma once
+
+// The eight over-time trees of one interval, one per over-time row class, and what is done to
+// them as a set: saving them as the interval's history files, loading an interval's files back
+// into them, and seeding a new interval with zero rows for the keys of the one that ended.
+//
+// The trees own their rows. Threads: the analyzer's tree lock guards a set and its rows.
+
+#include <memory>
+#include <vector>
+
+#include "core/runtime/ts_avl_tree.h"
+
+namespace history {
+class HistoryStore;
+}
+
+// The over-time tables, in the order transaction processing updates a page's tables, then the
+// sub-transaction table. Also the index into COverTimeTrees.
+enum class OverTimeTable : int {
+  kApplication,
+  kServerApp,
+  kServer,
+  kClientServer,
+  kClient,
+  kTransaction,
+  kClientApp,
+  kSubTransaction,
+};
+inline constexpr int kOverTimeTables = 8;
+
+// History file stem of each table ("q7appot" ...).
+const char* overTimeStem(OverTimeTable table);
+
+class COverTimeTrees {
+ public:
+  COverTimeTrees();
+  COverTimeTrees(const COverTimeTrees&) = delete;
+  COverTimeTrees& operator=(const COverTimeTrees&) = delete;
+
+  TSAVLTree& tree(OverTimeTable table) { return *trees_[static_cast<int>(table)]; }
+  const TSAVLTree& tree(OverTimeTable table) const { return *trees_[static_cast<int>(table)]; }
+  long totalRows() const;
+
+  // Writes every tree as interval's history file (an empty tree leaves an empty file). False
+  // when a file could not be written (traced by the store).
+  bool save(history::HistoryStore& store, long interval) const;
+  // Adds interval's history rows to the trees.
+  void load(history::HistoryStore& store, long interval);
+  // Adds, for every key of ended, a row with no requests starting at interval.
+  void seedZeroRows(const COverTimeTrees& ended, long interval);
+
+ private:
+  std::unique_ptr<TSAVLTree> trees_[kOverTimeTables];
+};
+
+// Every object of tree in its order (left to right), for copying rows out.
+void collectTreeNodes(AVLTree& tree, std::vector<TreeNode*>& nodes);

@@ -1,0 +1,261 @@
+// Transaction processing and the analyzer's interval work, driven with an injected clock.
+
+#include <gtest/gtest.h>
+#include <stdlib.h>
+#include <time.h>
+
+#include <atomic>
+#include <chrono>
+#include <filesystem>
+#include <map>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "core/analyzer/dpx_analyzer.h"
+#include "core/analyzer/dpx_transaction.h"
+#include "core/analyzer/rows/rows.h"
+#include "core/analyzer/situation_controller.h"
+#include "core/history/history_store.h"
+#include "framework/clock.h"
+#include "framework/trace_capture.h"
+#include "tama/cconfig.h"
+#include "tests/support/scratch_dir.h"
+
+namespace {
+
+constexpr long kStart = 1795000200;  // an interval start (a multiple of 300)
+
+class ProcessingTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    setenv("TZ", "UTC", 1);
+    tzset();
+    CConfig::setOverTimeInterval(5);
+    CConfig::setSummaryInterval(24);
+    now_ = kStart + 10;
+    fw::SetClockForTesting([this] { return static_cast<time_t>(now_.load()); });
+    analyzer_ = NewAnalyzer();
+  }
+  void TearDown() override {
+    analyzer_.reset();
+    fw::SetClockForTesting({});
+  }
+
+  // An analyzer on the test's directories; begun as its thread would begin unless it is to
+  // run as a thread.
+  std::unique_ptr<CDPXAnalyzer> NewAnalyzer(bool begin = true) {
+    auto analyzer = std::make_unique<CDPXAnalyzer>(
+        CDPXAnalyzer::Paths{dir_.file("dpx"), dir_.file("q7state.properties"), dir_.file("data")});
+    if (begin) {
+      analyzer->startRun();
+    }
+    return analyzer;
+  }
+
+  // A page (or, with a parent, an object) of app/url from client at time t.
+  CDPXTransaction Page(const char* app, const char* url, int rt = 100, int status = 200,
+                       const char* client = "10.1.2.3", long t = 0) {
+    SM3_HPAGE_ENTRY e{};
+    e.iTransTime = static_cast<int32_t>(t != 0 ? t : now_.load());
+    e.iTotalResponseTime = rt;
+    e.iRequestStatus = status;
+    snprintf(e.szURLHostName, sizeof(e.szURLHostName), "%s", app);
+    snprintf(e.szURL, sizeof(e.szURL), "%s", url);
+    snprintf(e.szIPSourceAddress, sizeof(e.szIPSourceAddress), "%s", client);
+    snprintf(e.szIPDestinationAddress, sizeof(e.szIPDestinationAddress), "192.0.2.10");
+    CDPXTransaction tx(e);
+    tx.setRecordType(1);
+    return tx;
+  }
+  CDPXTransaction Object(const char* app, const char* url, int status = 200) {
+    CDPXTransaction tx = Page(app, url, 50, status);
+    tx.setRecordType(2);
+    tx.setParentUUID(std::string(32, 'A').c_str());
+    tx.setRootUUID(std::string(32, 'A').c_str());
+    tx.setCurrentUUID(std::string(32, 'B').c_str());
+    tx.setControlFlags(1);
+    return tx;
+  }
+  void Process(CDPXTransaction tx) { analyzer_->processTransaction(tx, &level_); }
+
+  void AddPattern(const char* situation, const char* appName, const char* appPattern,
+                  const char* txName, const char* txPattern, int percent = 100,
+                  int16_t instances = 0, int16_t aggApp = 0, int16_t aggTx = 1) {
+    ASSERT_TRUE(analyzer_->newTransactionPattern(situation, appName, appPattern, txName, txPattern,
+                                                 aggApp, aggTx, instances, percent, 10000, 99));
+  }
+
+  // Each row of an over-time table as "<toString>" -> requests.
+  std::map<std::string, int> Rows(OverTimeTable table = OverTimeTable::kApplication) {
+    std::map<std::string, int> out;
+    analyzer_->Lock();
+    std::vector<TreeNode*> nodes;
+    collectTreeNodes(analyzer_->currentTrees().tree(table), nodes);
+    for (TreeNode* node : nodes) {
+      out[node->toString(0)] = static_cast<CBaseTable*>(node)->getCommon().totreq;
+    }
+    analyzer_->Unlock();
+    return out;
+  }
+  static std::string App(const std::string& name) { return "ApplicationName=" + name + "\n"; }
+
+  q7test::ScratchDir dir_;
+  std::atomic<long> now_{0};
+  std::unique_ptr<CDPXAnalyzer> analyzer_;
+  short level_ = 0;
+};
+
+// 50 % takes the 2nd, 4th and 6th match, 100 % every one; a sub-transaction is never sampled.
+TEST_F(ProcessingTest, SamplingTakesEverySecondMatch) {
+  AddPattern("half", "Half", "half.example", "Tx", "*", 50);
+  AddPattern("all", "All", "all.example", "Tx", "*", 100);
+  for (int i = 0; i < 6; ++i) {
+    Process(Page("half.example", "/a"));
+    Process(Page("all.example", "/a"));
+  }
+  auto rows = Rows();
+  EXPECT_EQ(3, rows[App("Half")]);
+  EXPECT_EQ(6, rows[App("All")]);
+  EXPECT_EQ(3, analyzer_->getTransactionsIgnored());
+  for (int i = 0; i < 3; ++i) {
+    Process(Object("half.example", "/a.css"));
+  }
+  EXPECT_EQ(3, Rows(OverTimeTable::kSubTransaction).begin()->second);
+}
+
+// The longer pattern wins an overlap, the earlier one a tie, and the overlap is reported.
+TEST_F(ProcessingTest, LongerPatternWinsAnOverlap) {
+  fw::TraceCapture capture("*=ERROR");
+  AddPattern("site", "Site", "*", "Any", "*");
+  AddPattern("checkout", "Shop", "*", "Checkout", "*/checkout*");
+  EXPECT_TRUE(capture.contains("TRANSPATTERN_OVERLAP_WARNING"));
+  EXPECT_TRUE(capture.contains("[checkout] [site] [checkout]"));
+  AddPattern("checkout2", "Other", "*", "Checkout2", "*/c*eckout*");  // same length: later
+  EXPECT_TRUE(capture.contains("[checkout2] [checkout] [checkout]"));
+  Process(Page("shop.example", "/shop/checkout?step=1"));
+  Process(Page("shop.example", "/shop/index"));
+  auto rows = Rows();
+  EXPECT_EQ(1, rows[App("Shop")]);
+  EXPECT_EQ(1, rows[App("Site")]);
+  EXPECT_EQ(0u, rows.count(App("Other")));
+}
+
+// Level 2 writes instance rows for bad statuses only, and the page's objects inherit it.
+TEST_F(ProcessingTest, InstanceLevelTwo) {
+  AddPattern("bad", "Shop", "*", "Tx", "*", 100, 2);
+  Process(Page("shop.example", "/ok", 100, 200));
+  Process(Page("shop.example", "/bad", 100, 500));
+  Process(Object("shop.example", "/bad.css", 404));
+  Process(Object("shop.example", "/good.css", 200));
+  analyzer_->Lock();
+  analyzer_->flushInstanceFile();
+  analyzer_->flushSubInstanceFile();
+  analyzer_->Unlock();
+  auto& store = analyzer_->historyStore();
+  const long interval = analyzer_->getCurrentOverTimeInterval();
+  EXPECT_EQ(1u, store.countRows("q7txins", interval, 1, 300, sizeof(kq7_q7txins_data_t)));
+  EXPECT_EQ(1u, store.countRows("q7subtxins", interval, 1, 300, sizeof(kq7_q7subtxins_data_t)));
+}
+
+// Without a client pattern a transaction keeps its client identity; a subnet pattern cuts
+// the address after its third dot; a name pattern reports every client under one name.
+TEST_F(ProcessingTest, ClientIdentity) {
+  AddPattern("all", "Shop", "*", "Tx", "*");
+  Process(Page("shop.example", "/a", 100, 200, "10.9.9.9"));
+  ASSERT_TRUE(analyzer_->newClientPattern("subnet", "Office", "10.1.*", "10.1.*", 2));
+  ASSERT_TRUE(analyzer_->newClientPattern("named", "Lab", "*", "192.168.*", 0));
+  Process(Page("shop.example", "/a", 100, 200, "10.1.2.3"));
+  Process(Page("shop.example", "/a", 100, 200, "10.1.2.4"));
+  Process(Page("shop.example", "/a", 100, 200, "192.168.7.1"));
+  auto clients = Rows(OverTimeTable::kClientServer);
+  EXPECT_EQ(1, clients["ClientName=10.9.9.9\nServerName=192.0.2.10\n"]);
+  EXPECT_EQ(2, clients["ClientName=10.1.2.*\nServerName=192.0.2.10\n"]);
+  EXPECT_EQ(1, clients["ClientName=Lab\nServerName=192.0.2.10\n"]);
+}
+
+// A transaction older than the reference interval is counted into it; one that is then still
+// older than the summary period (the clock moved on a day with no rollover yet) is counted as
+// processed but changes no table.
+TEST_F(ProcessingTest, OldTransactions) {
+  AddPattern("all", "Shop", "*", "Tx", "*");
+  Process(Page("shop.example", "/a", 100, 200, "10.1.2.3", kStart - 3600));
+  EXPECT_EQ(1, Rows()[App("Shop")]);
+  now_ = kStart + 25 * 3600;
+  Process(Page("shop.example", "/a", 100, 200, "10.1.2.3", kStart));
+  EXPECT_EQ(2, analyzer_->getTransactionsProcessed());
+  EXPECT_EQ(1, Rows()[App("Shop")]);
+}
+
+// Rows saved at a rollover come back from history with their key and figures; the current
+// interval's rows survive a restart within it.
+TEST_F(ProcessingTest, RolloverSavesAndRestartReloads) {
+  AddPattern("all", "Shop", "*", "Tx", "*");
+  Process(Page("shop.example", "/a", 120));
+  Process(Page("shop.example", "/a", 80, 503));
+  now_ = kStart + 300 + 1;
+  ASSERT_TRUE(analyzer_->rolloverDue());
+  analyzer_->rollover();
+  EXPECT_TRUE(Rows().empty());
+  const auto bytes =
+      analyzer_->historyStore().loadInterval(kStart, "q7appot", sizeof(kq7_q7appot_data_t));
+  ASSERT_EQ(sizeof(kq7_q7appot_data_t), bytes.size());
+  kq7_q7appot_data_t row;
+  memcpy(&row, bytes.data(), sizeof(row));
+  EXPECT_EQ("Shop", rows::FieldText(row.applicatin, 128));
+  EXPECT_EQ(2, row.totreq);
+  EXPECT_EQ(1, row.failreq);
+  EXPECT_EQ(100, row.oatime);
+
+  Process(Page("shop.example", "/a", 60));
+  analyzer_->finishRun();
+  analyzer_ = NewAnalyzer();
+  EXPECT_EQ(1, Rows()[App("Shop")]);
+}
+
+// The 12th rollover removes history older than the summary period; the first eleven do not.
+TEST_F(ProcessingTest, CleanupEveryTwelfthRollover) {
+  const std::string old = dir_.file("dpx/" + std::to_string(kStart - 30 * 3600) + "_1_q7appot.dat");
+  for (int i = 1; i <= 12; ++i) {
+    std::filesystem::create_directories(dir_.file("dpx"));
+    if (i == 1) {
+      dir_.write("dpx/" + std::to_string(kStart - 30 * 3600) + "_1_q7appot.dat", "x");
+    }
+    now_ = kStart + 300 * i + 1;
+    analyzer_->rollover();
+    EXPECT_EQ(i < 12, std::filesystem::exists(old)) << "rollover " << i;
+  }
+}
+
+// Patterns come back after a restart, in their order.
+TEST_F(ProcessingTest, PatternsSurviveARestart) {
+  AddPattern("short", "A", "*", "T", "*");
+  AddPattern("long", "B", "*.example", "T", "/shop/*");
+  analyzer_ = NewAnalyzer();
+  const auto patterns = analyzer_->situations().getTransactionPatterns();
+  ASSERT_EQ(2u, patterns.size());
+  EXPECT_STREQ("long", patterns[0].situationId);
+  EXPECT_STREQ("short", patterns[1].situationId);
+}
+
+// With nothing arriving, the running thread still rolls over within its 5 s queue wait.
+TEST_F(ProcessingTest, RolloverWithoutTraffic) {
+  analyzer_.reset();
+  auto analyzer = NewAnalyzer(false);
+  analyzer->Start();
+  now_ = kStart + 300 + 1;
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(8);
+  while (analyzer->getCurrentOverTimeInterval() != kStart + 300 &&
+         std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  }
+  EXPECT_EQ(kStart + 300, analyzer->getCurrentOverTimeInterval());
+  // A record of another kind reaches no tree and is not counted as ignored.
+  analyzer->add({7, new CDPXTransaction()});
+  analyzer->Shutdown();
+  analyzer->Join();
+  EXPECT_EQ(0, analyzer->getTransactionsIgnored());
+  EXPECT_EQ(0, analyzer->getTransactionsProcessed());
+}
+
+}  // namespace

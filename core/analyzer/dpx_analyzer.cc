@@ -1,0 +1,272 @@
+#include "core/analyzer/dpx_analyzer.h"
+
+#include <cstring>
+#include <mutex>
+#include <string>
+
+#include "core/analyzer/dpx_transaction.h"
+#include "core/analyzer/situation_controller.h"
+#include "core/history/history_store.h"
+#include "core/history/instance_file.h"
+#include "core/history/state_file.h"
+#include "core/runtime/clog.h"
+#include "framework/clock.h"
+#include "q7tema/table_layouts.h"
+#include "tama/agent_message.h"
+#include "tama/cconfig.h"
+
+namespace {
+
+// The queue wait of one pass: rollover and shutdown are noticed within it.
+constexpr long kQueueWaitMillis = 5000;
+// Every this many rollovers the old history files are removed.
+constexpr int kCleanupEveryRollovers = 12;
+
+long IntervalSeconds() {
+  return static_cast<long>(CConfig::getOverTimeInterval()) * 60;
+}
+long IntervalStart(long t) {
+  return t - (t % IntervalSeconds());
+}
+
+CDPXAnalyzer::FeederFactory& Factory() {
+  static CDPXAnalyzer::FeederFactory factory;
+  return factory;
+}
+
+CDPXAnalyzer::Paths DefaultPaths() {
+  CDPXAnalyzer::Paths paths;
+  paths.historyDirectory = CConfig::getDpxOdiDataDirectory();
+  paths.stateFile = std::string(CConfig::getBaseDirectory()) + "/q7state.properties";
+  paths.dataDirectory = CConfig::getDpxDataDirectory();
+  return paths;
+}
+
+std::once_flag g_once;
+CDPXAnalyzer* g_instance = nullptr;  // created once, lives for the process
+
+}  // namespace
+
+CDPXAnalyzer* CDPXAnalyzer::GetInstanceNoStart() {
+  std::call_once(g_once, [] { g_instance = new CDPXAnalyzer(DefaultPaths()); });
+  return g_instance;
+}
+
+CDPXAnalyzer* CDPXAnalyzer::GetInstance() {
+  static std::once_flag started;
+  CDPXAnalyzer* analyzer = GetInstanceNoStart();
+  std::call_once(started, [analyzer] { analyzer->Start(); });
+  return analyzer;
+}
+
+void CDPXAnalyzer::setFeederFactory(FeederFactory factory) {
+  Factory() = std::move(factory);
+}
+
+CDPXAnalyzer::CDPXAnalyzer(Paths p)
+    : CAnalyzer(p.historyDirectory.c_str()),
+      CvelThread("Analyzer"),
+      paths(std::move(p)),
+      history(std::make_unique<history::HistoryStore>(paths.historyDirectory)),
+      state(std::make_unique<history::StateFile>(paths.stateFile)),
+      trees(std::make_unique<COverTimeTrees>()),
+      instanceFile(std::make_unique<history::InstanceFile>(paths.historyDirectory, "q7txins",
+                                                           sizeof(kq7_q7txins_data_t))),
+      subInstanceFile(std::make_unique<history::InstanceFile>(paths.historyDirectory, "q7subtxins",
+                                                              sizeof(kq7_q7subtxins_data_t))) {
+  state->load();
+}
+
+CDPXAnalyzer::~CDPXAnalyzer() {
+  // Records still queued are the analyzer's: a drained queue is the rule, but free what is left.
+  _TYPED_TRANSACTION item;
+  while (newQueue && !newQueue->IsEmpty() && newQueue->Get(item, 0) == 0) {
+    delete item.transaction;
+  }
+}
+
+bool CDPXAnalyzer::rolloverDue() const {
+  return cacheActive ? isNewOverTimeInterval(referenceInterval) : isNewOverTimeInterval();
+}
+
+void CDPXAnalyzer::startRun() {
+  situations().loadPatternsIfNewer();
+  updateCurrentOverTimeInterval();
+  cleanupOldFiles();
+  CvelMutexLock lock(treeMutex);
+  // The current interval's rows saved by an earlier run stay the current trees, so a restart
+  // within an interval keeps its data.
+  trees->load(*history, getCurrentOverTimeInterval());
+  cacheActive = false;
+  referenceInterval = getCurrentOverTimeInterval();
+  rolloverCount = 0;
+}
+
+void CDPXAnalyzer::rollover() {
+  CvelMutexLock lock(treeMutex);
+  flushCache();
+  if (cacheActive) {
+    deactivateCache();
+  }
+  if (oldTransactions > 0) {
+    AgentMessage::sendMessage(
+        "OLD_TRANSACTIONS_WARNING", 5,
+        {std::to_string(oldTransactions), std::to_string(transactionsReceived)});
+  }
+  oldTransactions = 0;
+  transactionsReceived = 0;
+  const long ended = getCurrentOverTimeInterval();
+  saveIntervalData(ended);
+  updateCurrentOverTimeInterval();
+  auto fresh = std::make_unique<COverTimeTrees>();
+  if (CConfig::getReportZeroRecords()) {
+    fresh->seedZeroRows(*trees, getCurrentOverTimeInterval());
+  }
+  trees = std::move(fresh);
+  referenceInterval = getCurrentOverTimeInterval();
+  if (++rolloverCount % kCleanupEveryRollovers == 0) {
+    cleanupOldFiles();
+  }
+  situations().loadPatternsIfNewer();
+}
+
+void CDPXAnalyzer::finishRun() {
+  {
+    CvelMutexLock lock(treeMutex);
+    flushCache();
+    destroyCache();
+    saveAllData(getCurrentOverTimeInterval());
+    flushInstanceFile();
+    flushSubInstanceFile();
+  }
+  state->save();
+}
+
+void CDPXAnalyzer::Run() {
+  static const char* const kWhere = "CDPXAnalyzer::Run";
+  if (Factory()) {
+    feeder = Factory()(paths.dataDirectory.c_str());
+    if (feeder) {
+      feeder->start();
+    }
+  }
+  startRun();
+  bool shutdownSeen = false;
+  for (;;) {
+    if (isShutdownRequested()) {
+      if (!shutdownSeen) {
+        shutdownSeen = true;
+        CLOG::min("%s, Shutting down", kWhere);
+        if (feeder) {
+          feeder->shutdownAndJoin();
+        }
+      }
+      // The feeder is joined, so nothing more arrives once the queue is empty.
+      if (newQueue->IsEmpty()) {
+        finishRun();
+        return;
+      }
+    }
+    _TYPED_TRANSACTION item;
+    // An item without a transaction only wakes the loop (Shutdown queues one).
+    const bool got = newQueue->Get(item, kQueueWaitMillis) == 0 && item.transaction != nullptr;
+    if (got && item.type != TRANSACTION_KIND_DPX) {
+      CLOG::min(
+          "This transaction of type[%d] is not for this Analyzer[%d], it needs to be converted",
+          static_cast<int>(item.type), static_cast<int>(TRANSACTION_KIND_DPX));
+      // No other record kind is produced by this agent, so none can be converted.
+      CLOG::min("Failed to convert trans of type[%d] to [%d].  This transaction will be ignored.\n",
+                static_cast<int>(item.type), static_cast<int>(TRANSACTION_KIND_DPX));
+      delete item.transaction;
+      item.transaction = nullptr;
+    }
+    if (rolloverDue()) {
+      rollover();
+    }
+    if (got && item.transaction != nullptr) {
+      CLOG::med("Got a Transaction, Processing");
+      processTransaction(*static_cast<CDPXTransaction*>(item.transaction), &lastInstanceLevel);
+      delete item.transaction;
+    }
+  }
+}
+
+void CDPXAnalyzer::printPerformanceStats() const {
+  const int32_t processed = getTransactionsProcessed();
+  CLOG::min("Transactions Processed                 : %d", processed);
+  CLOG::min("Transactions Ignored                   : %d", getTransactionsIgnored());
+  CLOG::min("Total time Processing Transactions     : %d",
+            static_cast<int>(totalProcessingTime.load()));
+  if (processed > 0) {
+    CLOG::min("Average Time processing per transaction: %8.3f ms",
+              static_cast<double>(totalProcessingTime.load()) / processed);
+  } else {
+    CLOG::min("Average Time processing per transaction: 0.00 ms");
+  }
+}
+
+void CDPXAnalyzer::flushInstanceFile() {
+  instanceFile->flush();
+}
+void CDPXAnalyzer::flushSubInstanceFile() {
+  subInstanceFile->flush();
+}
+
+// ---- Caches ----
+
+void CDPXAnalyzer::loadCache(long interval) {
+  CLOG::med("Loading cache for interval[%d]", static_cast<int>(interval));
+  trees->load(*history, interval);
+}
+
+void CDPXAnalyzer::activateCache(long time) {
+  const long interval = IntervalStart(time);
+  CLOG::med("Activating cache for interval[%d] where currentTimePeriod[%d]",
+            static_cast<int>(interval), getCurrentOverTimeInterval());
+  savedTrees = std::move(trees);
+  trees = std::make_unique<COverTimeTrees>();
+  loadCache(interval);
+  cacheInterval = interval;
+  cacheActive = true;
+}
+
+void CDPXAnalyzer::deactivateCache() {
+  if (!cacheActive) {
+    CLOG::min("Error: Attempting to deactivate cache when one is not active");
+    return;
+  }
+  CLOG::med("Deactivating cache for interval[%d] where currentTimePeriod[%d]",
+            static_cast<int>(cacheInterval), getCurrentOverTimeInterval());
+  CLOG::med("Saving cache for interval[%d]", static_cast<int>(cacheInterval));
+  trees->save(*history, cacheInterval);
+  trees = std::move(savedTrees);
+  cacheActive = false;
+}
+
+void CDPXAnalyzer::flushCache() {
+  if (cacheActive) {
+    CLOG::med("Saving cache for interval[%d]", static_cast<int>(cacheInterval));
+    trees->save(*history, cacheInterval);
+  }
+}
+
+void CDPXAnalyzer::destroyCache() {
+  if (cacheActive) {
+    trees = std::move(savedTrees);
+    cacheActive = false;
+  }
+}
+
+void CDPXAnalyzer::saveIntervalData(long interval) {
+  trees->save(*history, interval);
+  flushInstanceFile();
+  flushSubInstanceFile();
+}
+
+void CDPXAnalyzer::saveAllData(long interval) {
+  saveIntervalData(interval);
+}
+
+void CDPXAnalyzer::cleanupOldFiles() {
+  history->cleanupOldFiles(fw::Now(), static_cast<long>(CConfig::getSummaryInterval()) * 3600);
+}

@@ -1,0 +1,117 @@
+#pragma once
+
+// CDPXAnalyzer: the analyzer of web transactions, a process-wide singleton. Its thread is the
+// transaction queue's only consumer: it processes each transaction into the current interval's
+// over-time trees, rolls the trees over at every interval boundary (saving them as history),
+// swaps a past interval's rows in (a cache) for transactions that belong to it, and at shutdown
+// drains the queue and saves everything.
+//
+// Threads: GetInstance/GetInstanceNoStart from any thread (the first call creates the object);
+// add() from intake threads; Lock()/Unlock() and the queries from framework threads; the rest
+// from the analyzer thread. The tree lock (Lock/Unlock) guards the trees, the cache state and
+// the instance files.
+
+#include <functional>
+#include <memory>
+
+#include "core/analyzer/analysis/over_time_trees.h"
+#include "core/analyzer/analyzer.h"
+#include "core/runtime/cvel_mutex.h"
+#include "core/runtime/cvel_thread.h"
+
+class CDPXTransaction;
+namespace history {
+class HistoryStore;
+class InstanceFile;
+class StateFile;
+}  // namespace history
+
+// What feeds the queue: the file manager thread. The analyzer creates it when its thread
+// starts and stops it first at shutdown.
+class CAnalyzerFeeder {
+ public:
+  virtual ~CAnalyzerFeeder() = default;
+  virtual void start() = 0;
+  // Asks the feeder to stop and waits for its thread.
+  virtual void shutdownAndJoin() = 0;
+};
+
+class CDPXAnalyzer : public CAnalyzer, public CvelThread {
+ public:
+  // Directories the analyzer works in. The defaults come from CConfig.
+  struct Paths {
+    std::string historyDirectory;  // over-time history, instance and pattern files
+    std::string stateFile;         // the last-history-sent state
+    std::string dataDirectory;     // where the collector writes (handed to the feeder)
+  };
+  using FeederFactory = std::function<std::unique_ptr<CAnalyzerFeeder>(const char* dataDir)>;
+
+  // The singleton, created on first use; GetInstance also starts its thread.
+  static CDPXAnalyzer* GetInstance();
+  static CDPXAnalyzer* GetInstanceNoStart();
+  // Sets what creates the feeder when the thread starts (none: nothing feeds the queue but
+  // add() calls). Call before the thread starts.
+  static void setFeederFactory(FeederFactory factory);
+
+  // A free-standing analyzer (tests and benchmarks); the process uses the singleton.
+  explicit CDPXAnalyzer(Paths paths);
+  ~CDPXAnalyzer() override;
+
+  void Lock() { treeMutex.Lock(); }
+  void Unlock() { treeMutex.Unlock(); }
+
+  // Processes one transaction (see transaction_processing.cc). instanceLevel carries the
+  // instance level of the last page to the objects that follow it.
+  void processTransaction(CDPXTransaction& transaction, short* instanceLevel);
+
+  // The rollover test and the rollover itself, as Run does them each pass.
+  bool rolloverDue() const;
+  void rollover();
+
+  void printPerformanceStats() const;
+
+  // The current interval's trees, or the cache's when one is active. Tree lock held.
+  COverTimeTrees& currentTrees() { return *trees; }
+  // Writes the instance files' buffered records. Tree lock held.
+  void flushInstanceFile();
+  void flushSubInstanceFile();
+  history::HistoryStore& historyStore() { return *history; }
+  int getRolloverCount() const { return rolloverCount; }
+
+  // Start-of-run work (interval, cleanup, the current interval's saved rows) and end-of-run
+  // work (save everything), as Run does them; tests drive them directly.
+  void startRun();
+  void finishRun();
+
+ protected:
+  void Run() override;
+
+ private:
+  // Caches: a past interval's rows swapped in for transactions that belong to it. Tree lock.
+  void activateCache(long time);
+  void deactivateCache();
+  void loadCache(long interval);
+  void flushCache();
+  void destroyCache();
+  void saveIntervalData(long interval);
+  void saveAllData(long interval);
+  void cleanupOldFiles();
+
+  const Paths paths;
+  std::unique_ptr<history::HistoryStore> history;
+  std::unique_ptr<history::StateFile> state;
+  std::unique_ptr<CAnalyzerFeeder> feeder;  // analyzer thread only
+
+  CvelMutex treeMutex;
+  // treeMutex guards the following.
+  std::unique_ptr<COverTimeTrees> trees;       // the trees processing updates
+  std::unique_ptr<COverTimeTrees> savedTrees;  // the current interval's while a cache is active
+  bool cacheActive = false;
+  long cacheInterval = 0;
+  long referenceInterval = 0;
+  std::unique_ptr<history::InstanceFile> instanceFile;
+  std::unique_ptr<history::InstanceFile> subInstanceFile;
+
+  int rolloverCount = 0;        // analyzer thread
+  short lastInstanceLevel = 0;  // analyzer thread: the level of the last page
+};
