@@ -90,8 +90,14 @@ const char* overTimeStem(OverTimeTable table) {
 }
 
 void collectTreeNodes(AVLTree& tree, std::vector<TreeNode*>& nodes) {
-  nodes.reserve(nodes.size() + static_cast<size_t>(tree.getSize()));
+  const size_t before = nodes.size();
+  nodes.reserve(before + static_cast<size_t>(tree.getSize()));
   Collect(tree, tree.getRoot(), nodes);
+  const size_t copied = nodes.size() - before;
+  if (copied != static_cast<size_t>(tree.getSize())) {
+    CLOG::min("ERROR: Copy'd %d nodes from tree of size[%d]", static_cast<int>(copied),
+              static_cast<int>(tree.getSize()));
+  }
 }
 
 COverTimeTrees::COverTimeTrees() {

@@ -4,6 +4,7 @@
 
 #include <cstring>
 #include <memory>
+#include <optional>
 
 #include "core/analyzer/analysis/instance_rows.h"
 #include "core/analyzer/common.h"
@@ -94,8 +95,21 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
   CSituationController& controller = situations();
   TransactionMatch* txMatches = nullptr;
   ClientMatch* clientMatches = nullptr;
-  TransactionMatch madeUpTx;
-  ClientMatch madeUpClient;
+  // The made-up matches of an object and of a client no pattern names: built once, since a
+  // match record is over a kilobyte to clear.
+  static const ClientMatch kOwnIdentity = [] {
+    ClientMatch m;
+    m.pattern.aggregateUniquely = 1;
+    return m;
+  }();
+  static const TransactionMatch kObjectMatch = [] {
+    TransactionMatch m;
+    m.pattern.aggappsuniq = 1;
+    m.pattern.aggtxsuniq = 1;
+    m.pattern.samplePercent = 100;
+    return m;
+  }();
+  std::optional<TransactionMatch> madeUpTx;
   bool madeUp = false;
   if (page) {
     txMatches = controller.matchTransactionPatterns(
@@ -109,13 +123,10 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
   } else {
     // An object of a page counts under its own names, at the level of the page before it.
     madeUp = true;
-    madeUpTx.pattern.aggappsuniq = 1;
-    madeUpTx.pattern.aggtxsuniq = 1;
-    madeUpTx.pattern.collectInstances = *instanceLevel;
-    madeUpTx.pattern.samplePercent = 100;
-    madeUpClient.pattern.aggregateUniquely = 1;
-    txMatches = &madeUpTx;
-    clientMatches = &madeUpClient;
+    madeUpTx.emplace(kObjectMatch);
+    madeUpTx->pattern.collectInstances = *instanceLevel;
+    txMatches = &*madeUpTx;
+    clientMatches = const_cast<ClientMatch*>(&kOwnIdentity);
   }
 
   // 6.
@@ -132,14 +143,14 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
   }
 
   // 7.
-  ClientMatch ownIdentity;
-  ownIdentity.pattern.aggregateUniquely = 1;
   if (clientMatches == nullptr) {
     CLOG::med("Transaction did not match a client pattern.");
   }
+  const bool onePair =
+      txMatches->next == nullptr && (clientMatches == nullptr || clientMatches->next == nullptr);
   for (const TransactionMatch* tm = txMatches; tm != nullptr; tm = tm->next) {
     const TransactionPattern& tp = tm->pattern;
-    for (const ClientMatch* cm = clientMatches != nullptr ? clientMatches : &ownIdentity;
+    for (const ClientMatch* cm = clientMatches != nullptr ? clientMatches : &kOwnIdentity;
          cm != nullptr; cm = cm->next) {
       const ClientPattern& cp = cm->pattern;
       // a.
@@ -149,8 +160,13 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
         level = transaction.getControlFlags() & 3;
         importance = (transaction.getControlFlags() >> 8) & 255;
       }
-      // b.
-      CDPXTransaction w(transaction);
+      // b. The analyzer asks for the first match only, so there is one pair and the record
+      // itself can be the working copy; a copy (4.6 KB) is made only when more pairs follow.
+      std::unique_ptr<CDPXTransaction> copy;
+      if (!onePair) {
+        copy = std::make_unique<CDPXTransaction>(transaction);
+      }
+      CDPXTransaction& w = copy ? *copy : transaction;
       int aggBy = 0;
       if (tp.aggappsuniq != 0) {
         aggBy |= kAggByApplication;
@@ -220,9 +236,9 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
           InstancePatterns names;
           if (!madeUp) {
             names = {tp.applicationPattern, tp.transactionPattern,
-                     cm == &ownIdentity ? "" : cp.clientName,
-                     cm == &ownIdentity ? "" : cp.hostNamePattern,
-                     cm == &ownIdentity ? "" : cp.ipAddressPattern};
+                     cm == &kOwnIdentity ? "" : cp.clientName,
+                     cm == &kOwnIdentity ? "" : cp.hostNamePattern,
+                     cm == &kOwnIdentity ? "" : cp.ipAddressPattern};
           }
           if (page) {
             kq7_q7txins_data_t row;

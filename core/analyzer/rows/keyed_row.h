@@ -368,7 +368,9 @@ class TKeyedRow : public CBaseTable {
 
   char* keyAt(std::size_t i) { return keys_ + kOffsets.at[i]; }
 
-  char keys_[kOffsets.total] = {};
+  // Both constructors write every key byte, so the keys need no clearing first: rows are built
+  // for every lookup on the per-transaction path.
+  char keys_[kOffsets.total];
   Carried carried_;
 };
 
