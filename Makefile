@@ -6,7 +6,7 @@
 #   make bench    Release build of the benchmarks, then run them
 #   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/
 #   make asan / make tsan   sanitizer builds with their unit tests
-#   make test-tsan          the runtime primitives' tests under ThreadSanitizer
+#   make test-tsan          the concurrency tests (runtime, situations, analyzer) under TSan
 #   make fuzz     clang libFuzzer build of the record parser, run for FUZZ_SECONDS (default 60)
 
 SHELL := /bin/bash
@@ -59,11 +59,13 @@ tsan: deps
 	cmake --build build-tsan -j $(JOBS)
 	cd build-tsan && ctest --output-on-failure -j $(JOBS) -L unit --timeout 300
 
-# The concurrency primitives under ThreadSanitizer (part of make test).
+# The concurrency code under ThreadSanitizer (part of make test): the runtime primitives, the
+# situation controller shared by framework threads and the analyzer, and the analyzer thread.
 test-tsan: deps
 	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON
-	cmake --build build-tsan -j $(JOBS) --target runtime_test
+	cmake --build build-tsan -j $(JOBS) --target runtime_test analyzer_test
 	build-tsan/bin/runtime_test --gtest_brief=1
+	build-tsan/bin/analyzer_test --gtest_brief=1 --gtest_filter='Situation*:Processing*:WaitFor*'
 
 bench: deps
 	cmake -S . -B build-release $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Release -DQ7_BUILD_TESTS=OFF
