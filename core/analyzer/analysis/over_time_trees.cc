@@ -12,7 +12,7 @@ template <class Row>
 bool SaveTree(TSAVLTree& tree, history::HistoryStore& store, long interval, const char* stem) {
   using Layout = typename Row::LayoutType;
   std::vector<TreeNode*> nodes;
-  collectTreeNodes(tree, nodes);
+  getTreeNodes(tree, nodes);
   std::vector<Layout> rows(nodes.size());
   for (size_t i = 0; i < nodes.size(); ++i) {
     static_cast<Row*>(nodes[i])->getQ7Struct(rows[i]);
@@ -42,7 +42,7 @@ template <class Row>
 void SeedTree(TSAVLTree& tree, TSAVLTree& ended, long interval) {
   using Layout = typename Row::LayoutType;
   std::vector<TreeNode*> nodes;
-  collectTreeNodes(ended, nodes);
+  getTreeNodes(ended, nodes);
   for (TreeNode* node : nodes) {
     Layout layout;
     static_cast<Row*>(node)->getQ7Struct(layout);
@@ -89,7 +89,7 @@ const char* overTimeStem(OverTimeTable table) {
   return kTables[static_cast<int>(table)].stem;
 }
 
-void collectTreeNodes(AVLTree& tree, std::vector<TreeNode*>& nodes) {
+void getTreeNodes(AVLTree& tree, std::vector<TreeNode*>& nodes) {
   const size_t before = nodes.size();
   nodes.reserve(before + static_cast<size_t>(tree.getSize()));
   Collect(tree, tree.getRoot(), nodes);

@@ -55,4 +55,4 @@ class COverTimeTrees {
 };
 
 // Every object of tree in its order (left to right), for copying rows out.
-void collectTreeNodes(AVLTree& tree, std::vector<TreeNode*>& nodes);
+void getTreeNodes(AVLTree& tree, std::vector<TreeNode*>& nodes);

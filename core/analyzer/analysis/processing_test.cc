@@ -91,7 +91,7 @@ class ProcessingTest : public ::testing::Test {
     std::map<std::string, int> out;
     analyzer_->Lock();
     std::vector<TreeNode*> nodes;
-    collectTreeNodes(analyzer_->currentTrees().tree(table), nodes);
+    getTreeNodes(analyzer_->currentTrees().tree(table), nodes);
     for (TreeNode* node : nodes) {
       out[node->toString(0)] = static_cast<CBaseTable*>(node)->getCommon().totreq;
     }
@@ -211,6 +211,20 @@ TEST_F(ProcessingTest, RolloverSavesAndRestartReloads) {
   analyzer_->finishRun();
   analyzer_ = NewAnalyzer();
   EXPECT_EQ(1, Rows()[App("Shop")]);
+}
+
+// With zero records asked for, a key that went quiet stays in the new interval with no requests.
+TEST_F(ProcessingTest, QuietKeysKeepZeroRows) {
+  CConfig::setReportZeroRecords(true);
+  AddPattern("all", "Shop", "*", "Tx", "*");
+  Process(Page("shop.example", "/a"));
+  now_ = kStart + 300 + 1;
+  analyzer_->rollover();
+  CConfig::setReportZeroRecords(false);
+  const auto rows = Rows();
+  ASSERT_EQ(1u, rows.count(App("Shop")));
+  EXPECT_EQ(0, rows.at(App("Shop")));
+  EXPECT_EQ(1u, Rows(OverTimeTable::kTransaction).size());
 }
 
 // The 12th rollover removes history older than the summary period; the first eleven do not.
