@@ -46,6 +46,14 @@ std::string LastErrorLocation() {
   return stack.GetFirstFunction();
 }
 
+// A thread object destroyed without being started ends its waiting system thread and never runs
+// the body (destroying the start event under the waiting thread used to hang).
+TEST(CvelThreadTest, DestroyingAnUnstartedThreadEndsIt) {
+  std::atomic<bool> ran{false};
+  { FunctionThread thread([&ran](FunctionThread&) { ran = true; }); }
+  EXPECT_FALSE(ran.load());
+}
+
 // A thread runs once: the second Start is refused and recorded.
 TEST(CvelThreadTest, SecondStartGivesBadState) {
   std::atomic<int> runs{0};
