@@ -15,6 +15,7 @@
 #include <memory>
 
 #include "core/analyzer/analysis/over_time_trees.h"
+#include "core/analyzer/analysis/table_queries.h"
 #include "core/analyzer/analyzer.h"
 #include "core/runtime/cvel_mutex.h"
 #include "core/runtime/cvel_thread.h"
@@ -70,13 +71,47 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
 
   void printPerformanceStats() const;
 
+  // ---- Table queries (table_queries.cc). Each returns a new[] array of table rows the caller
+  // releases with delete[], and their count through count (null with 0). Only sample type 3
+  // yields rows. The public ones take the tree lock, flush the cache and stamp sampletime; the
+  // inner ones (i_get_tbl...) run with the lock held. ----
+#define Q7_DECLARE_OVER_TIME_QUERY(name)                            \
+  kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count); \
+  kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count, bool currentOnly);
+#define Q7_DECLARE_QUERY(name)                                      \
+  kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count); \
+  kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count);
+  Q7_OVER_TIME_QUERIES(Q7_DECLARE_OVER_TIME_QUERY)
+  Q7_SUMMARY_QUERIES(Q7_DECLARE_QUERY)
+  Q7_INSTANCE_QUERIES(Q7_DECLARE_QUERY)
+#undef Q7_DECLARE_QUERY
+#undef Q7_DECLARE_OVER_TIME_QUERY
+  // Current-status rows: the current interval's over-time rows without aggby.
+  kq7_q7appcs_data_t* get_tblappcs(int sampleType, int* count);
+  kq7_q7txcs_data_t* get_tbltxcs(int sampleType, int* count);
+  kq7_q7clntcs_data_t* get_tblclntcs(int sampleType, int* count);
+  kq7_q7srvcs_data_t* get_tblsrvcs(int sampleType, int* count);
+
+  // Intervals in the summary period: summary hours x 60 / over-time minutes.
+  static int summaryIntervals();
+
   // The current interval's trees, or the cache's when one is active. Tree lock held.
-  COverTimeTrees& currentTrees() { return *trees; }
+  COverTimeTrees& currentTrees() {
+    return *trees;
+  }
+  // The current interval's trees whether or not a cache is swapped in. Tree lock held.
+  COverTimeTrees& currentIntervalTrees() {
+    return cacheActive ? *savedTrees : *trees;
+  }
   // Writes the instance files' buffered records. Tree lock held.
   void flushInstanceFile();
   void flushSubInstanceFile();
-  history::HistoryStore& historyStore() { return *history; }
-  int getRolloverCount() const { return rolloverCount; }
+  history::HistoryStore& historyStore() {
+    return *history;
+  }
+  int getRolloverCount() const {
+    return rolloverCount;
+  }
 
   // Start-of-run work (interval, cleanup, the current interval's saved rows) and end-of-run
   // work (save everything), as Run does them; tests drive them directly.
@@ -92,6 +127,17 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   void deactivateCache();
   void loadCache(long interval);
   void flushCache();
+  template <class OverTimeRow>
+  typename OverTimeRow::LayoutType* overTimeQuery(OverTimeTable table, const char* where,
+                                                  int sampleType, int* count, bool currentOnly);
+  template <class SummaryRow>
+  typename SummaryRow::LayoutType* summaryQuery(
+      typename SummaryRow::OverTimeLayoutType* (CDPXAnalyzer::*inner)(int, int*, bool),
+      const char* where, int sampleType, int* count);
+  template <class Layout>
+  Layout* instanceQuery(const char* stem, const char* where, int sampleType, int* count);
+  template <class Layout, class Inner>
+  Layout* lockedQuery(Inner inner, int* count);
   void destroyCache();
   void saveIntervalData(long interval);
   void saveAllData(long interval);

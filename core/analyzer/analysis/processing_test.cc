@@ -12,6 +12,7 @@
 #include <thread>
 #include <vector>
 
+#include "core/analyzer/analysis/analyzer_fixture.h"
 #include "core/analyzer/dpx_analyzer.h"
 #include "core/analyzer/dpx_transaction.h"
 #include "core/analyzer/rows/rows.h"
@@ -24,87 +25,8 @@
 
 namespace {
 
-constexpr long kStart = 1795000200;  // an interval start (a multiple of 300)
-
-class ProcessingTest : public ::testing::Test {
- protected:
-  void SetUp() override {
-    setenv("TZ", "UTC", 1);
-    tzset();
-    CConfig::setOverTimeInterval(5);
-    CConfig::setSummaryInterval(24);
-    now_ = kStart + 10;
-    fw::SetClockForTesting([this] { return static_cast<time_t>(now_.load()); });
-    analyzer_ = NewAnalyzer();
-  }
-  void TearDown() override {
-    analyzer_.reset();
-    fw::SetClockForTesting({});
-  }
-
-  // An analyzer on the test's directories; begun as its thread would begin unless it is to
-  // run as a thread.
-  std::unique_ptr<CDPXAnalyzer> NewAnalyzer(bool begin = true) {
-    auto analyzer = std::make_unique<CDPXAnalyzer>(
-        CDPXAnalyzer::Paths{dir_.file("dpx"), dir_.file("q7state.properties"), dir_.file("data")});
-    if (begin) {
-      analyzer->startRun();
-    }
-    return analyzer;
-  }
-
-  // A page (or, with a parent, an object) of app/url from client at time t.
-  CDPXTransaction Page(const char* app, const char* url, int rt = 100, int status = 200,
-                       const char* client = "10.1.2.3", long t = 0) {
-    SM3_HPAGE_ENTRY e{};
-    e.iTransTime = static_cast<int32_t>(t != 0 ? t : now_.load());
-    e.iTotalResponseTime = rt;
-    e.iRequestStatus = status;
-    snprintf(e.szURLHostName, sizeof(e.szURLHostName), "%s", app);
-    snprintf(e.szURL, sizeof(e.szURL), "%s", url);
-    snprintf(e.szIPSourceAddress, sizeof(e.szIPSourceAddress), "%s", client);
-    snprintf(e.szIPDestinationAddress, sizeof(e.szIPDestinationAddress), "192.0.2.10");
-    CDPXTransaction tx(e);
-    tx.setRecordType(1);
-    return tx;
-  }
-  CDPXTransaction Object(const char* app, const char* url, int status = 200) {
-    CDPXTransaction tx = Page(app, url, 50, status);
-    tx.setRecordType(2);
-    tx.setParentUUID(std::string(32, 'A').c_str());
-    tx.setRootUUID(std::string(32, 'A').c_str());
-    tx.setCurrentUUID(std::string(32, 'B').c_str());
-    tx.setControlFlags(1);
-    return tx;
-  }
-  void Process(CDPXTransaction tx) { analyzer_->processTransaction(tx, &level_); }
-
-  void AddPattern(const char* situation, const char* appName, const char* appPattern,
-                  const char* txName, const char* txPattern, int percent = 100,
-                  int16_t instances = 0, int16_t aggApp = 0, int16_t aggTx = 1) {
-    ASSERT_TRUE(analyzer_->newTransactionPattern(situation, appName, appPattern, txName, txPattern,
-                                                 aggApp, aggTx, instances, percent, 10000, 99));
-  }
-
-  // Each row of an over-time table as "<toString>" -> requests.
-  std::map<std::string, int> Rows(OverTimeTable table = OverTimeTable::kApplication) {
-    std::map<std::string, int> out;
-    analyzer_->Lock();
-    std::vector<TreeNode*> nodes;
-    getTreeNodes(analyzer_->currentTrees().tree(table), nodes);
-    for (TreeNode* node : nodes) {
-      out[node->toString(0)] = static_cast<CBaseTable*>(node)->getCommon().totreq;
-    }
-    analyzer_->Unlock();
-    return out;
-  }
-  static std::string App(const std::string& name) { return "ApplicationName=" + name + "\n"; }
-
-  q7test::ScratchDir dir_;
-  std::atomic<long> now_{0};
-  std::unique_ptr<CDPXAnalyzer> analyzer_;
-  short level_ = 0;
-};
+using q7test::kStart;
+using ProcessingTest = q7test::AnalyzerFixture;
 
 // 50 % takes the 2nd, 4th and 6th match, 100 % every one; a sub-transaction is never sampled.
 TEST_F(ProcessingTest, SamplingTakesEverySecondMatch) {

@@ -1,0 +1,266 @@
+// The analyzer's side of sampling: rows of the current interval's over-time trees plus the
+// summary period's history, summaries folded from them at query time, instance rows from the
+// instance files, and current-status rows.
+
+#include <cstring>
+#include <memory>
+#include <vector>
+
+#include "core/analyzer/dpx_analyzer.h"
+#include "core/analyzer/rows/rows.h"
+#include "core/history/history_store.h"
+#include "core/runtime/clog.h"
+#include "framework/clock.h"
+#include "tama/cconfig.h"
+
+namespace {
+
+long IntervalSeconds() {
+  return static_cast<long>(CConfig::getOverTimeInterval()) * 60;
+}
+
+// History rows to load: the count capped at MAX_ROWS, with the trace when it is cut.
+size_t Capped(size_t rows) {
+  if (rows > static_cast<size_t>(MAX_ROWS)) {
+    CLOG::min("Too many rows %d > MAX_ROWS(%d), will return MAX_ROWS", static_cast<int>(rows),
+              MAX_ROWS);
+    return MAX_ROWS;
+  }
+  return rows;
+}
+
+template <class Layout>
+void StampSampleTime(Layout* rows, int count, time_t now) {
+  char text[17];
+  TimeSince70ToMordel(now, text);
+  for (int i = 0; i < count; ++i) {
+    memcpy(rows[i].sampletime, text, sizeof(rows[i].sampletime));
+  }
+}
+
+// Current-status conversions: every column of the current-status layout from the over-time
+// column of the same name (the layouts differ only by aggby).
+#define Q7_COPY_COLUMN(kind, name, width) memcpy(&to.name, &from.name, sizeof(to.name));
+
+}  // namespace
+
+#define Q7_DEFINE_CONVERSION(ot, cs, COLUMNS)                                                \
+  void q7_convert_##ot##_to_##cs(const kq7_q7##ot##_data_t& from, kq7_q7##cs##_data_t& to) { \
+    COLUMNS(Q7_COPY_COLUMN)                                                                  \
+  }
+Q7_DEFINE_CONVERSION(appot, appcs, Q7_COLS_APPCS)
+Q7_DEFINE_CONVERSION(txot, txcs, Q7_COLS_TXCS)
+Q7_DEFINE_CONVERSION(clntot, clntcs, Q7_COLS_CLNTCS)
+Q7_DEFINE_CONVERSION(srvot, srvcs, Q7_COLS_SRVCS)
+#undef Q7_DEFINE_CONVERSION
+#undef Q7_COPY_COLUMN
+
+int CDPXAnalyzer::summaryIntervals() {
+  return CConfig::getSummaryInterval() * 60 / CConfig::getOverTimeInterval();
+}
+
+template <class OverTimeRow>
+typename OverTimeRow::LayoutType* CDPXAnalyzer::overTimeQuery(OverTimeTable table,
+                                                              const char* where, int sampleType,
+                                                              int* count, bool currentOnly) {
+  using Layout = typename OverTimeRow::LayoutType;
+  CLOG::enter(2, "%s(%d,--,%d)", where, sampleType, currentOnly ? 1 : 0);
+  *count = 0;
+  if (sampleType != 3) {
+    CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
+    return nullptr;
+  }
+  const long interval = getCurrentOverTimeInterval();
+  const long length = IntervalSeconds();
+  const char* stem = overTimeStem(table);
+  const size_t historyRows =
+      currentOnly ? 0
+                  : Capped(history->countRows(stem, interval - length, summaryIntervals(), length,
+                                              sizeof(Layout)));
+  TSAVLTree& tree = currentIntervalTrees().tree(table);
+  const size_t current = static_cast<size_t>(tree.getSize());
+  if (historyRows + current == 0) {
+    CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
+    return nullptr;
+  }
+  auto rows = std::make_unique<Layout[]>(historyRows + current);
+  std::vector<TreeNode*> nodes;
+  getTreeNodes(tree, nodes);
+  for (size_t i = 0; i < nodes.size() && i < current; ++i) {
+    static_cast<OverTimeRow*>(nodes[i])->getQ7Struct(rows[i]);
+  }
+  size_t loaded = 0;
+  if (historyRows > 0) {
+    loaded = history->loadRows(stem, interval - length, summaryIntervals(), length, sizeof(Layout),
+                               historyRows, rows.get() + current);
+  }
+  *count = static_cast<int>(current + loaded);
+  CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
+  return rows.release();
+}
+
+template <class SummaryRow>
+typename SummaryRow::LayoutType* CDPXAnalyzer::summaryQuery(
+    typename SummaryRow::OverTimeLayoutType* (CDPXAnalyzer::*inner)(int, int*, bool),
+    const char* where, int sampleType, int* count) {
+  using Layout = typename SummaryRow::LayoutType;
+  using OverTimeLayout = typename SummaryRow::OverTimeLayoutType;
+  CLOG::enter(2, "%s(%d,--)", where, sampleType);
+  *count = 0;
+  TSAVLTree folded(0, false);
+  int overTimeCount = 0;
+  std::unique_ptr<OverTimeLayout[]> overTime((this->*inner)(sampleType, &overTimeCount, false));
+  if (overTime && overTimeCount > 0) {
+    CLOG::max("%s, current data present.", where);
+    for (int i = 0; i < overTimeCount; ++i) {
+      SummaryRow key(overTime[i]);
+      key.setDeleteOnRemoval(false);  // a lookup key: the tree must not destroy it
+      if (auto* row = static_cast<SummaryRow*>(folded.findNode(&key))) {
+        row->Update(overTime[i]);
+        continue;
+      }
+      auto row = std::make_unique<SummaryRow>(overTime[i]);
+      if (folded.addNode(row.get())) {
+        row.release();  // the temporary tree owns it
+      }
+    }
+  } else {
+    CLOG::max("%s, no current data.", where);
+  }
+  overTime.reset();
+  Layout* rows = nullptr;
+  if (folded.getSize() >= 1) {
+    std::vector<TreeNode*> nodes;
+    getTreeNodes(folded, nodes);
+    rows = new Layout[nodes.size()];
+    for (size_t i = 0; i < nodes.size(); ++i) {
+      static_cast<SummaryRow*>(nodes[i])->getQ7Struct(rows[i]);
+    }
+    *count = static_cast<int>(nodes.size());
+  }
+  CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
+  return rows;
+}
+
+template <class Layout>
+Layout* CDPXAnalyzer::instanceQuery(const char* stem, const char* where, int sampleType,
+                                    int* count) {
+  CLOG::enter(2, "%s(%d,--)", where, sampleType);
+  *count = 0;
+  if (sampleType != 3) {
+    CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
+    return nullptr;
+  }
+  flushInstanceFile();
+  flushSubInstanceFile();
+  const long interval = getCurrentOverTimeInterval();
+  const long length = IntervalSeconds();
+  const size_t records =
+      Capped(history->countRows(stem, interval, summaryIntervals(), length, sizeof(Layout)));
+  if (records < 1) {
+    CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
+    return nullptr;
+  }
+  auto rows = std::make_unique<Layout[]>(records);
+  *count = static_cast<int>(history->loadRows(stem, interval, summaryIntervals(), length,
+                                              sizeof(Layout), records, rows.get()));
+  CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
+  return rows.release();
+}
+
+template <class Layout, class Inner>
+Layout* CDPXAnalyzer::lockedQuery(Inner inner, int* count) {
+  const time_t now = fw::Now();
+  Layout* rows;
+  {
+    CvelMutexLock lock(treeMutex);
+    flushCache();
+    rows = inner();
+  }
+  // Stamped once the lock is released: sampling must not hold up processing for it.
+  StampSampleTime(rows, *count, now);
+  return rows;
+}
+
+// ---- The named queries. ----
+
+#define Q7_OVER_TIME(name, table, Row)                                                    \
+  kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count,        \
+                                                       bool currentOnly) {                \
+    return overTimeQuery<Row>(OverTimeTable::table, "i_get_tbl" #name, sampleType, count, \
+                              currentOnly);                                               \
+  }                                                                                       \
+  kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) {        \
+    return lockedQuery<kq7_q7##name##_data_t>(                                            \
+        [&] { return i_get_tbl##name(sampleType, count, false); }, count);                \
+  }
+Q7_OVER_TIME(appot, kApplication, CApplicationOverTime)
+Q7_OVER_TIME(clntappot, kClientApp, CClientAppOverTime)
+Q7_OVER_TIME(clntot, kClient, CClientOverTime)
+Q7_OVER_TIME(clntsrvot, kClientServer, CClientServerOverTime)
+Q7_OVER_TIME(srvappot, kServerApp, CServerAppOverTime)
+Q7_OVER_TIME(srvot, kServer, CServerOverTime)
+Q7_OVER_TIME(txot, kTransaction, CTransactionOverTime)
+Q7_OVER_TIME(subtxot, kSubTransaction, CSubTransactionOverTime)
+#undef Q7_OVER_TIME
+
+#define Q7_SUMMARY(name, overTime, Row)                                                           \
+  kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count) {              \
+    return summaryQuery<Row>(&CDPXAnalyzer::i_get_tbl##overTime, "i_get_tbl" #name, sampleType,   \
+                             count);                                                              \
+  }                                                                                               \
+  kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) {                \
+    return lockedQuery<kq7_q7##name##_data_t>([&] { return i_get_tbl##name(sampleType, count); }, \
+                                              count);                                             \
+  }
+Q7_SUMMARY(appsm, appot, CApplicationSummary)
+Q7_SUMMARY(clntapp, clntappot, CClientAppSummary)
+Q7_SUMMARY(clntsm, clntot, CClientSummary)
+Q7_SUMMARY(clntsrv, clntsrvot, CClientServerSummary)
+Q7_SUMMARY(srvappsm, srvappot, CServerAppSummary)
+Q7_SUMMARY(srvsm, srvot, CServerSummary)
+Q7_SUMMARY(txsm, txot, CTransactionSummary)
+Q7_SUMMARY(subtxsm, subtxot, CSubTransactionSummary)
+#undef Q7_SUMMARY
+
+#define Q7_INSTANCE(name)                                                                          \
+  kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count) {               \
+    return instanceQuery<kq7_q7##name##_data_t>("q7" #name, "i_get_tbl" #name, sampleType, count); \
+  }                                                                                                \
+  kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) {                 \
+    return lockedQuery<kq7_q7##name##_data_t>([&] { return i_get_tbl##name(sampleType, count); },  \
+                                              count);                                              \
+  }
+Q7_INSTANCE(txins)
+Q7_INSTANCE(subtxins)
+#undef Q7_INSTANCE
+
+#define Q7_CURRENT_STATUS(cs, ot)                                              \
+  kq7_q7##cs##_data_t* CDPXAnalyzer::get_tbl##cs(int sampleType, int* count) { \
+    CLOG::enter(2, "%s(%d,--)", "get_tbl" #cs, sampleType);                    \
+    const time_t now = fw::Now();                                              \
+    int overTimeCount = 0;                                                     \
+    std::unique_ptr<kq7_q7##ot##_data_t[]> overTime;                           \
+    {                                                                          \
+      CvelMutexLock lock(treeMutex);                                           \
+      flushCache();                                                            \
+      overTime.reset(i_get_tbl##ot(sampleType, &overTimeCount, true));         \
+    }                                                                          \
+    *count = 0;                                                                \
+    kq7_q7##cs##_data_t* rows = nullptr;                                       \
+    if (overTime && overTimeCount > 0) {                                       \
+      rows = new kq7_q7##cs##_data_t[overTimeCount];                           \
+      for (int i = 0; i < overTimeCount; ++i) {                                \
+        q7_convert_##ot##_to_##cs(overTime[i], rows[i]);                       \
+      }                                                                        \
+      *count = overTimeCount;                                                  \
+      StampSampleTime(rows, *count, now);                                      \
+    }                                                                          \
+    CLOG::exit(2, "%s(%d,%d)", "get_tbl" #cs, sampleType, *count);             \
+    return rows;                                                               \
+  }
+Q7_CURRENT_STATUS(appcs, appot)
+Q7_CURRENT_STATUS(txcs, txot)
+Q7_CURRENT_STATUS(clntcs, clntot)
+Q7_CURRENT_STATUS(srvcs, srvot)
+#undef Q7_CURRENT_STATUS
