@@ -6,12 +6,17 @@
 #include <chrono>
 #include <cstring>
 #include <nlohmann/json.hpp>
+#include <optional>
 #include <string>
 #include <thread>
+#include <utility>
+#include <vector>
 
 #include "framework/agent_runtime.h"
 #include "framework/runtime_state.h"
+#include "framework/sample_query.h"
 #include "framework/status.h"
+#include "framework/table_sample.h"
 #include "framework/tables.h"
 #include "framework/trace.h"
 
@@ -24,9 +29,12 @@ constexpr std::size_t kWorkerThreads = 16;
 
 const auto kProcessStart = std::chrono::steady_clock::now();
 
-void ReplyJson(httplib::Response& res, int status, const nlohmann::json& body) {
+// Table rows and echoed request text need not be valid UTF-8; a strict dump would throw.
+template <typename Json>
+void ReplyJson(httplib::Response& res, int status, const Json& body) {
   res.status = status;
-  res.set_content(body.dump(2) + "\n", "application/json");
+  res.set_content(body.dump(2, ' ', false, Json::error_handler_t::replace) + "\n",
+                  "application/json");
 }
 
 void ReplyError(httplib::Response& res, int status, const std::string& message) {
@@ -81,6 +89,63 @@ nlohmann::json Tables() {
     tables.push_back({{"name", table->name}, {"columns", std::move(columns)}});
   }
   return nlohmann::json{{"tables", std::move(tables)}};
+}
+
+// GET /api/v1/tables/{TABLE}: one sample, filtered, limited and formatted as the query asks.
+void ServeSample(const httplib::Request& req, httplib::Response& res) {
+  const std::string name = req.matches[1];
+  const std::shared_ptr<const TableDefinition> table = FindTable(name);
+  if (table == nullptr) {
+    ReplyError(res, 404, "no table named " + name);
+    return;
+  }
+  std::string error;
+  std::vector<Condition> conditions;
+  for (std::size_t i = 0; i < req.get_param_value_count("where"); ++i) {
+    Condition condition;
+    if (ParseWhere(req.get_param_value("where", i), table->columns, &condition, &error) != kOk) {
+      ReplyError(res, 400, error);
+      return;
+    }
+    conditions.push_back(std::move(condition));
+  }
+  std::optional<std::size_t> limit;
+  SampleFormat format = SampleFormat::kJson;
+  for (const char* key : {"limit", "format"}) {
+    if (req.get_param_value_count(key) > 1) {
+      ReplyError(res, 400, std::string(key) + " given more than once");
+      return;
+    }
+  }
+  if (req.has_param("limit")) {
+    std::size_t value = 0;
+    if (ParseLimit(req.get_param_value("limit"), &value, &error) != kOk) {
+      ReplyError(res, 400, error);
+      return;
+    }
+    limit = value;
+  }
+  if (req.has_param("format") &&
+      ParseSampleFormat(req.get_param_value("format"), &format, &error) != kOk) {
+    ReplyError(res, 400, error);
+    return;
+  }
+
+  Sample sample;
+  const int status = SampleTable(table->name, std::move(conditions), &sample, &error);
+  if (status != kOk) {
+    ReplyError(res, status == kNotFound ? 404 : 500, error);
+    return;
+  }
+  if (limit.has_value()) {
+    sample.Truncate(*limit);
+  }
+  if (format == SampleFormat::kCsv) {
+    res.status = 200;
+    res.set_content(SampleToCsv(sample), "text/csv");
+  } else {
+    ReplyJson(res, 200, SampleToJson(sample));
+  }
 }
 
 }  // namespace
@@ -152,6 +217,7 @@ void HttpServer::InstallRoutes() {
         [](const httplib::Request&, httplib::Response& res) { ReplyJson(res, 200, AgentInfo()); });
   s.Get("/api/v1/tables",
         [](const httplib::Request&, httplib::Response& res) { ReplyJson(res, 200, Tables()); });
+  s.Get(R"(/api/v1/tables/([A-Za-z0-9_]+))", ServeSample);
 }
 
 int HttpServer::Start(const std::string& address, std::string* error) {

@@ -4,6 +4,7 @@
 // the row struct's own (offsetof), so the descriptions cannot drift from the rows.
 //
 //   q7tema::TableLayout<kq7_q7appot_data_t>::kName     "Q7APPOT"
+//   q7tema::TableLayout<kq7_q7appot_data_t>::kLowerName "q7appot"
 //   q7tema::TableLayout<kq7_q7appot_data_t>::kColumns  std::array<fw::ColumnInfo, N>
 //   kq7_q7appot_columns                                 the same array
 //
@@ -36,6 +37,7 @@ struct TableLayout;
   struct TableLayout<::kq7_##lower##_data_t> {                                                   \
     using Row = ::kq7_##lower##_data_t;                                                          \
     static constexpr std::string_view kName = exported;                                          \
+    static constexpr std::string_view kLowerName = #lower;                                       \
     static constexpr auto kColumns = std::to_array<::fw::ColumnInfo>({COLUMNS(Q7_COLUMN_INFO)}); \
   };
 

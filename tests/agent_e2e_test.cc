@@ -183,6 +183,22 @@ TEST_F(AgentE2ETest, ListsTheTablesInLoadOrder) {
   EXPECT_EQ(std::string::npos, trace().find("refused")) << trace();
 }
 
+// A table sample over HTTP: empty while nothing feeds the tables, filters accepted, unknown
+// tables refused.
+TEST_F(AgentE2ETest, SamplesATable) {
+  const std::string address = start();
+  int status = 0;
+  const nlohmann::json body = get(address, "/api/v1/tables/Q7TXSM", &status);
+  EXPECT_EQ(200, status);
+  EXPECT_EQ(nlohmann::json::parse(R"({"table": "Q7TXSM", "rows": []})"), body);
+  const nlohmann::json missing = get(address, "/api/v1/tables/NOPE", &status);
+  EXPECT_EQ(404, status);
+  EXPECT_EQ("no table named NOPE", missing.value("error", ""));
+  get(address, "/api/v1/tables/Q7TXSM?where=TOTREQ%20GT%205", &status);
+  EXPECT_EQ(200, status);
+  stopWith(SIGTERM);
+}
+
 // SIGINT stops the agent just as SIGTERM does.
 TEST_F(AgentE2ETest, StopsOnSigint) {
   start();
