@@ -1,10 +1,32 @@
 #include "tama/install_hooks.h"
 
 #include "core/analyzer/dpx_analyzer.h"
+#include "q7tema/row_query.h"
+#include "tama/agent_details.h"
 #include "tama/agent_hooks.h"
 #include "tama/agent_message.h"
 
 namespace tama {
+
+namespace {
+
+// The exported row tables the analyzer answers.
+#define Q7_ANALYZER_ROW_TABLES(X)                                                           \
+  X(appot)                                                                                  \
+  X(appsm) X(clntapp) X(clntot) X(clntsm) X(clntsrv) X(srvappsm) X(srvot) X(srvsm) X(txins) \
+      X(txot) X(txsm) X(txcs) X(appcs) X(clntcs) X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
+
+void installRowQueries() {
+#define Q7_ROW_QUERY(name)                                                       \
+  q7tema::SetRowQuery<kq7_q7##name##_data_t>([](int sampleType, int* count) {    \
+    return CDPXAnalyzer::GetInstanceNoStart()->get_tbl##name(sampleType, count); \
+  });
+  Q7_ANALYZER_ROW_TABLES(Q7_ROW_QUERY)
+#undef Q7_ROW_QUERY
+  q7tema::SetRowQuery<kq7_q7agntdts_data_t>(&getAgentDetailRows);
+}
+
+}  // namespace
 
 void installAgentHooks() {
   AgentHooks& hooks = agentHooks();
@@ -15,6 +37,7 @@ void installAgentHooks() {
                                 const std::vector<std::string>& args) {
     AgentMessage::sendMessage(key, severity, args);
   };
+  installRowQueries();
 }
 
 }  // namespace tama
