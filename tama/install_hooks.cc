@@ -5,16 +5,18 @@
 #include "tama/agent_details.h"
 #include "tama/agent_hooks.h"
 #include "tama/agent_message.h"
+#include "tama/test_feeder.h"
 
 namespace tama {
 
 namespace {
 
 // The exported row tables the analyzer answers.
-#define Q7_ANALYZER_ROW_TABLES(X)                                                           \
-  X(appot)                                                                                  \
-  X(appsm) X(clntapp) X(clntot) X(clntsm) X(clntsrv) X(srvappsm) X(srvot) X(srvsm) X(txins) \
-      X(txot) X(txsm) X(txcs) X(appcs) X(clntcs) X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
+#define Q7_ANALYZER_ROW_TABLES(X)                                                                  \
+  X(appot)                                                                                         \
+  X(appsm)                                                                                         \
+  X(clntapp) X(clntot) X(clntsm) X(clntsrv) X(srvappsm) X(srvot) X(srvsm) X(txins) X(txot) X(txsm) \
+      X(txcs) X(appcs) X(clntcs) X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
 
 void installRowQueries() {
 #define Q7_ROW_QUERY(name)                                                       \
@@ -38,6 +40,7 @@ void installAgentHooks() {
     AgentMessage::sendMessage(key, severity, args);
   };
   installRowQueries();
+  installTestFeeder();
 }
 
 }  // namespace tama

@@ -10,8 +10,10 @@
 #include <filesystem>
 #include <nlohmann/json.hpp>
 #include <string>
+#include <thread>
 #include <vector>
 
+#include "core/analyzer/situation_controller.h"
 #include "tests/agent_process.h"
 
 namespace q7test {
@@ -22,9 +24,12 @@ using namespace std::chrono_literals;
 class AgentE2ETest : public ::testing::Test {
  protected:
   std::map<std::string, std::string> env() const {
-    return {{"Q7_HOME", home_.path()}, {"Q7_HTTP_ADDRESS", "127.0.0.1:0"},
-            {"Q7_TRACE", "*=ALL"},     {"Q7_TRACE_FILE", ""},
-            {"DPX_NOSTART", ""},       {"TZ", "UTC"}};
+    std::map<std::string, std::string> vars = {
+        {"Q7_HOME", home_.path()}, {"Q7_HTTP_ADDRESS", "127.0.0.1:0"},
+        {"Q7_TRACE", "*=ALL"},     {"Q7_TRACE_FILE", ""},
+        {"DPX_NOSTART", ""},       {"TZ", "UTC"}};
+    vars.insert(extraEnv_.begin(), extraEnv_.end());
+    return vars;
   }
   std::string tracePath() const { return home_.path() + "logs/q7agent.log"; }
   std::string trace() const { return readFile(tracePath()); }
@@ -71,8 +76,16 @@ class AgentE2ETest : public ::testing::Test {
     EXPECT_EQ(0, WEXITSTATUS(*status));
   }
 
+  // The body of a GET as text (CSV replies).
+  std::string getText(const std::string& address, const std::string& path) {
+    httplib::Client client("http://" + address);
+    auto res = client.Get(path.c_str());
+    return res ? res->body : std::string();
+  }
+
   TempHome home_;
   std::unique_ptr<AgentProcess> agent_;
+  std::map<std::string, std::string> extraEnv_;
 };
 
 // --help and --version print, exit 0 and create nothing in the home.
@@ -232,6 +245,89 @@ TEST_F(AgentE2ETest, BadConfigurationIsTracedNotFatal) {
   const std::string t = trace();
   EXPECT_NE(std::string::npos, t.find("Error: unable to parse config file"));
   EXPECT_NE(std::string::npos, t.find("Invalid Overtime Interval 0"));
+}
+
+// Transactions fed through the analyzer reach the summary, current-status and instance tables
+// with the counts of sm3gen's truth; a filter and CSV work on them.
+TEST_F(AgentE2ETest, FedTransactionsReachTheTables) {
+  // Keep the whole test inside one 5-minute interval, so current-status rows hold everything.
+  while (time(nullptr) % 300 > 280) {
+    std::this_thread::sleep_for(1s);
+  }
+  const std::string data = home_.path() + "feed.sm3";
+  const std::string truthPath = home_.path() + "truth.json";
+  const std::string command = std::string(SM3GEN_PATH) + " --out " + data + " --truth " +
+                              truthPath + " --records 400 --sites 2 --seed 3 --rate 1000 --start " +
+                              std::to_string(time(nullptr) - 1);
+  ASSERT_EQ(0, system(command.c_str()));
+  const nlohmann::json truth = nlohmann::json::parse(readFile(truthPath));
+  long pages = 0;
+  for (const auto& [app, figures] : truth["applications"].items()) {
+    pages += figures["pages"]["count"].get<long>();
+  }
+  ASSERT_GT(pages, 10);
+  {
+    // One catch-all pattern keeping every name, collecting every instance.
+    CSituationController controller(base() + "odi/dpx");
+    auto pattern = std::make_unique<TransactionPattern>();
+    setPatternText(pattern->applicationName, "All");
+    setPatternText(pattern->applicationPattern, "*");
+    setPatternText(pattern->transactionName, "All");
+    setPatternText(pattern->transactionPattern, "*");
+    setPatternText(pattern->situationId, "everything");
+    pattern->aggappsuniq = 1;
+    pattern->aggtxsuniq = 1;
+    pattern->collectInstances = 1;
+    pattern->mrtthres = 10000000;
+    ASSERT_TRUE(controller.addTransactionPattern(std::move(pattern)));
+  }
+  extraEnv_["Q7_TEST_FEED_FILE"] = data;
+  const std::string address = start();
+
+  auto total = [](const nlohmann::json& body) {
+    long sum = 0;
+    for (const auto& row : body["rows"]) {
+      sum += row["totreq"].get<long>();
+    }
+    return sum;
+  };
+  int status = 0;
+  nlohmann::json summary;
+  EXPECT_TRUE(waitFor(
+      [&] {
+        summary = get(address, "/api/v1/tables/Q7TXSM", &status);
+        return status == 200 && total(summary) == pages;
+      },
+      15s))
+      << "counted " << total(summary) << " of " << pages;
+
+  const nlohmann::json current = get(address, "/api/v1/tables/Q7APPCS", &status);
+  ASSERT_EQ(200, status);
+  for (const auto& row : current["rows"]) {
+    const std::string app = row["applicatin"];
+    EXPECT_EQ(truth["applications"][app]["pages"]["count"].get<long>(), row["totreq"].get<long>())
+        << app;
+    EXPECT_FALSE(row.contains("aggby"));
+  }
+  EXPECT_EQ(pages, total(current));
+
+  const nlohmann::json instances = get(address, "/api/v1/tables/Q7TXINS", &status);
+  EXPECT_EQ(pages, static_cast<long>(instances["rows"].size()));
+
+  const nlohmann::json busy = get(address, "/api/v1/tables/Q7TXSM?where=TOTREQ%20GT%205", &status);
+  long expected = 0;
+  for (const auto& row : summary["rows"]) {
+    expected += row["totreq"].get<long>() > 5 ? 1 : 0;
+  }
+  EXPECT_EQ(expected, static_cast<long>(busy["rows"].size()));
+  for (const auto& row : busy["rows"]) {
+    EXPECT_GT(row["totreq"].get<long>(), 5);
+  }
+
+  const std::string csv = getText(address, "/api/v1/tables/Q7TXSM?format=csv&limit=1");
+  EXPECT_EQ(0u, csv.find("applicatin,transactn,client,server,rootuuid,importance,originnode,"))
+      << csv.substr(0, 200);
+  stopWith(SIGTERM);
 }
 
 }  // namespace
