@@ -124,10 +124,10 @@ class FakeMonitor : public tama::CollectorMonitor {
 void installFakeHooks() {
   g_events.clear();
   tama::AgentHooks& hooks = tama::agentHooks();
-  hooks.make_collector_monitor = [](const tama::CollectorMonitorSpec& spec) {
-    const std::string which = spec.start_argv.back();
+  hooks.make_collector_monitor = [](const tama::CollectorMonitorSpec& monitor) {
+    const std::string which = monitor.start_argv.back();
     g_events.push_back("create " + which + " " +
-                       std::filesystem::path(spec.pid_file).filename().string());
+                       std::filesystem::path(monitor.pid_file).filename().string());
     return std::unique_ptr<tama::CollectorMonitor>(new FakeMonitor(which));
   };
   hooks.start_analyzer = [] { g_events.push_back("analyzer start"); };
