@@ -434,6 +434,24 @@ int CSituationController::removeClientPatterns(const char* situationId) {
   return remove(situationId, clientFile_, &clients_);
 }
 
+namespace {
+
+// Appends a copy of pattern to a match list through *tail. Out of memory drops the match with
+// a trace: the transaction is then treated as matching fewer patterns, never crashes.
+template <class Node, class Pattern>
+void AppendMatch(Node*** tail, const Pattern& pattern, const char* where, const char* text) {
+  Node* node = new (std::nothrow) Node;
+  if (node == nullptr) {
+    CLOG::error("%s: out of memory; match of [%s] dropped", where, text);
+    return;
+  }
+  node->pattern = pattern;
+  **tail = node;
+  *tail = &node->next;
+}
+
+}  // namespace
+
 TransactionMatch* CSituationController::matchTransactionPatterns(const char* applicationName,
                                                                  const char* transactionName,
                                                                  bool all, bool sample) {
@@ -461,15 +479,7 @@ TransactionMatch* CSituationController::matchTransactionPatterns(const char* app
       }
     }
     if (taken) {
-      TransactionMatch* node = new (std::nothrow) TransactionMatch;
-      if (node == nullptr) {
-        CLOG::error("%s: out of memory; match of [%s] dropped",
-                    "CSituationController::matchTransactionPatterns", p.transactionPattern);
-      } else {
-        node->pattern = p;
-        *tail = node;
-        tail = &node->next;
-      }
+      AppendMatch(&tail, p, "CSituationController::matchTransactionPatterns", p.transactionPattern);
     }
     if (!all) {
       break;
@@ -492,15 +502,7 @@ ClientMatch* CSituationController::matchClientPatterns(const char* clientName,
         !CCommon::patternMatches(p.ipAddressPattern, clientIPAddress, e.second.get())) {
       continue;
     }
-    ClientMatch* node = new (std::nothrow) ClientMatch;
-    if (node == nullptr) {
-      CLOG::error("%s: out of memory; match of [%s] dropped",
-                  "CSituationController::matchClientPatterns", p.hostNamePattern);
-    } else {
-      node->pattern = p;
-      *tail = node;
-      tail = &node->next;
-    }
+    AppendMatch(&tail, p, "CSituationController::matchClientPatterns", p.hostNamePattern);
     if (!all) {
       break;
     }

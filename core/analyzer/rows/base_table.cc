@@ -31,18 +31,6 @@ void ClampNegativeSum(int64_t* sum, const char* negativeFormat, const char* rese
   *sum = 0;
 }
 
-// value / n * 100000, divided first, in extended precision, truncated toward zero.
-int32_t Percent(long double value, long double n) {
-  if (value == 0) {
-    return 0;  // exact, without the costly truncating conversion
-  }
-  return static_cast<int32_t>(value / n * 100000.0L);
-}
-
-int32_t Average(int64_t sum, int32_t n) {
-  return static_cast<int32_t>(sum / n);
-}
-
 }  // namespace
 
 CBaseTable::CBaseTable()
@@ -166,13 +154,13 @@ CommonColumns CBaseTable::getCommonData() const {
   out.succreq = commonData.succreq;
   out.minrtt = commonData.minrtt;
   out.maxrtt = commonData.mmaxrtt;
-  out.oatime = Average(commonData.oatime, n);
-  out.clienttime = Average(commonData.clienttime, n);
-  out.netwtime = Average(commonData.netwtime, n);
-  out.servtime = Average(commonData.servtime, n);
+  out.oatime = perRequest(commonData.oatime, n);
+  out.clienttime = perRequest(commonData.clienttime, n);
+  out.netwtime = perRequest(commonData.netwtime, n);
+  out.servtime = perRequest(commonData.servtime, n);
 
-  int32_t slow = Percent(commonData.slowreq, n);
-  int32_t fail = Percent(commonData.failreq, n);
+  int32_t slow = percentOfRequests(commonData.slowreq, n);
+  int32_t fail = percentOfRequests(commonData.failreq, n);
   int32_t good = static_cast<int32_t>(
       100000.0L * (static_cast<long double>(commonData.succreq) / static_cast<long double>(n)));
   const int32_t leftover = 100000 - (fail + slow + good);
@@ -355,6 +343,19 @@ char* dumpLYNData(const lyn_data_t& d, char* buffer) {
           static_cast<int>(d.brwsrcon), static_cast<int>(d.conntime),
           static_cast<int>(d.avdwnldtm));
   return buffer;
+}
+
+int32_t percentOfRequests(int32_t count, int32_t n) {
+  // Most status counters of a row are 0; skipping the extended-precision division for them
+  // (whose truncating conversion stalls the x87 unit) gives the same 0 much sooner.
+  if (n == 0 || count == 0) {
+    return 0;
+  }
+  return static_cast<int32_t>(static_cast<long double>(count) / n * 100000.0L);
+}
+
+int32_t perRequest(int64_t sum, int32_t n) {
+  return n == 0 ? 0 : static_cast<int32_t>(sum / n);
 }
 
 long calculateRank(long a, long b, short c) {

@@ -74,6 +74,12 @@ char* dumpDPXData(const dpx_data_t& data, char* buffer);
 char* dumpARMData(const carm_data_t& data, char* buffer);
 char* dumpLYNData(const lyn_data_t& data, char* buffer);
 
+// count / n in thousandths of a percent: divided first, in extended precision, truncated
+// toward zero; 0 for an empty row.
+int32_t percentOfRequests(int32_t count, int32_t n);
+// sum / n truncated toward zero; 0 for an empty row.
+int32_t perRequest(int64_t sum, int32_t n);
+
 // (a * 100 + b) * (100 - c), wrapping in 32 bits.
 long calculateRank(long a, long b, short c);
 

@@ -26,17 +26,4 @@ const char* KeySource(const CTransaction& t, Key key) {
   return "";
 }
 
-int32_t CounterPercent(int32_t counter, int32_t n) {
-  // Most status counters of a row are 0; skipping the extended-precision division for them
-  // (whose truncating conversion stalls the x87 unit) gives the same 0 much sooner.
-  if (n == 0 || counter == 0) {
-    return 0;
-  }
-  return static_cast<int32_t>(static_cast<long double>(counter) / n * 100000.0L);
-}
-
-int32_t PerRequest(int64_t sum, int32_t n) {
-  return n == 0 ? 0 : static_cast<int32_t>(sum / n);
-}
-
 }  // namespace rows

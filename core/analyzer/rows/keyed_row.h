@@ -167,11 +167,6 @@ LayoutValues ValuesOf(const Layout& row) {
   return v;
 }
 
-// counter / n in thousandths of a percent, truncated; 0 for an empty row.
-int32_t CounterPercent(int32_t counter, int32_t n);
-// sum / n truncated; 0 for an empty row.
-int32_t PerRequest(int64_t sum, int32_t n);
-
 template <const auto& kSpec>
 class TKeyedRow : public CBaseTable {
  public:
@@ -296,19 +291,19 @@ class TKeyedRow : public CBaseTable {
 
     const int32_t n = commonData.totreq;
     const dpx_data_t& d = kindData.dpx;
-    row.loadtime = PerRequest(d.loadtime, n);
-    row.resolvtime = PerRequest(d.resolvtime, n);
-    row.reqpacket = PerRequest(d.reqpacket, n);
-    row.ackpacket = PerRequest(d.ackpacket, n);
-    row.replypckt = PerRequest(d.replypckt, n);
-    row.replyack = PerRequest(d.replyack, n);
-    row.totbytes = PerRequest(d.totbytes, n);
-    row.reqbytes = PerRequest(d.reqbytes, n);
-    row.replybyt = PerRequest(d.replybyt, n);
-    row.objcnt = PerRequest(d.objcnt, n);
-    row.objsize = PerRequest(d.objsize, n);
-    row.headrreq = PerRequest(d.headrreq, n);
-    row.hdrreqrslv = PerRequest(d.hdrreqrslv, n);
+    row.loadtime = perRequest(d.loadtime, n);
+    row.resolvtime = perRequest(d.resolvtime, n);
+    row.reqpacket = perRequest(d.reqpacket, n);
+    row.ackpacket = perRequest(d.ackpacket, n);
+    row.replypckt = perRequest(d.replypckt, n);
+    row.replyack = perRequest(d.replyack, n);
+    row.totbytes = perRequest(d.totbytes, n);
+    row.reqbytes = perRequest(d.reqbytes, n);
+    row.replybyt = perRequest(d.replybyt, n);
+    row.objcnt = perRequest(d.objcnt, n);
+    row.objsize = perRequest(d.objsize, n);
+    row.headrreq = perRequest(d.headrreq, n);
+    row.hdrreqrslv = perRequest(d.hdrreqrslv, n);
     row.num1xx = d.num1xx;
     row.num2xx = d.num2xx;
     row.num3xx = d.num3xx;
@@ -317,14 +312,14 @@ class TKeyedRow : public CBaseTable {
     row.num403 = d.num403;
     row.num404 = d.num404;
     row.num500 = d.num500;
-    row.pct1xx = CounterPercent(d.num1xx, n);
-    row.pct2xx = CounterPercent(d.num2xx, n);
-    row.pct3xx = CounterPercent(d.num3xx, n);
-    row.pct4xx = CounterPercent(d.num4xx, n);
-    row.pct5xx = CounterPercent(d.num5xx, n);
-    row.pct403 = CounterPercent(d.num403, n);
-    row.pct404 = CounterPercent(d.num404, n);
-    row.pct500 = CounterPercent(d.num500, n);
+    row.pct1xx = percentOfRequests(d.num1xx, n);
+    row.pct2xx = percentOfRequests(d.num2xx, n);
+    row.pct3xx = percentOfRequests(d.num3xx, n);
+    row.pct4xx = percentOfRequests(d.num4xx, n);
+    row.pct5xx = percentOfRequests(d.num5xx, n);
+    row.pct403 = percentOfRequests(d.num403, n);
+    row.pct404 = percentOfRequests(d.num404, n);
+    row.pct500 = percentOfRequests(d.num500, n);
   }
 
  private:
