@@ -1,11 +1,11 @@
 #include "tama/install_hooks.h"
 
 #include "core/analyzer/dpx_analyzer.h"
+#include "core/analyzer/dpx_file_manager.h"
 #include "q7tema/row_query.h"
 #include "tama/agent_details.h"
 #include "tama/agent_hooks.h"
 #include "tama/agent_message.h"
-#include "tama/test_feeder.h"
 
 namespace tama {
 
@@ -40,7 +40,12 @@ void installAgentHooks() {
     AgentMessage::sendMessage(key, severity, args);
   };
   installRowQueries();
-  installTestFeeder();
+  // The file manager tails the collector's data directory for the analyzer.
+  CDPXAnalyzer::setFeederFactory([](const char* dataDirectory) {
+    auto manager = std::make_unique<CDPXFileManager>();
+    manager->setDirToWatch(dataDirectory);
+    return std::unique_ptr<CAnalyzerFeeder>(std::move(manager));
+  });
 }
 
 }  // namespace tama

@@ -247,14 +247,17 @@ TEST_F(AgentE2ETest, BadConfigurationIsTracedNotFatal) {
   EXPECT_NE(std::string::npos, t.find("Invalid Overtime Interval 0"));
 }
 
-// Transactions fed through the analyzer reach the summary, current-status and instance tables
+// Transactions read from the collector's data directory reach the summary, current-status and instance tables
 // with the counts of sm3gen's truth; a filter and CSV work on them.
 TEST_F(AgentE2ETest, FedTransactionsReachTheTables) {
   // Keep the whole test inside one 5-minute interval, so current-status rows hold everything.
   while (time(nullptr) % 300 > 280) {
     std::this_thread::sleep_for(1s);
   }
-  const std::string data = home_.path() + "feed.sm3";
+  const std::string data = home_.path() + "data/feed.sm3";
+  home_.writeFile("config/" + shortHostName() + "_q7.cfg",
+                  "[AGENT]\nKQ7DPXLOGPATH=" + home_.path() + "data\n");
+  std::filesystem::create_directories(home_.path() + "data");
   const std::string truthPath = home_.path() + "truth.json";
   const std::string command = std::string(SM3GEN_PATH) + " --out " + data + " --truth " +
                               truthPath + " --records 400 --sites 2 --seed 3 --rate 1000 --start " +
@@ -281,7 +284,6 @@ TEST_F(AgentE2ETest, FedTransactionsReachTheTables) {
     pattern->mrtthres = 10000000;
     ASSERT_TRUE(controller.addTransactionPattern(std::move(pattern)));
   }
-  extraEnv_["Q7_TEST_FEED_FILE"] = data;
   const std::string address = start();
 
   auto total = [](const nlohmann::json& body) {

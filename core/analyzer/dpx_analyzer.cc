@@ -1,7 +1,9 @@
 #include "core/analyzer/dpx_analyzer.h"
 
 #include <cstring>
+#include <atomic>
 #include <mutex>
+#include <thread>
 #include <string>
 
 #include "core/analyzer/dpx_transaction.h"
@@ -19,6 +21,8 @@ namespace {
 
 // The queue wait of one pass: rollover and shutdown are noticed within it.
 constexpr long kQueueWaitMillis = 5000;
+// The queue wait while the feeder is being stopped.
+constexpr long kShutdownWaitMillis = 50;
 // Every this many rollovers the old history files are removed.
 constexpr int kCleanupEveryRollovers = 12;
 
@@ -152,24 +156,38 @@ void CDPXAnalyzer::Run() {
   }
   startRun();
   bool shutdownSeen = false;
+  // Stops the feeder at shutdown. It runs beside this loop because a reader may be blocked on
+  // the full queue, which only this loop empties.
+  std::thread feederStopper;
+  std::atomic<bool> feederStopped{false};
   for (;;) {
     if (isShutdownRequested()) {
       if (!shutdownSeen) {
         shutdownSeen = true;
         CLOG::min("%s, Shutting down", kWhere);
         if (feeder) {
-          feeder->shutdownAndJoin();
+          feederStopper = std::thread([this, &feederStopped] {
+            feeder->shutdownAndJoin();
+            feederStopped.store(true);
+          });
+        } else {
+          feederStopped.store(true);
         }
       }
-      // The feeder is joined, so nothing more arrives once the queue is empty.
-      if (newQueue->IsEmpty()) {
+      // Once the feeder has stopped nothing more arrives, so an empty queue is the end.
+      if (feederStopped.load() && newQueue->IsEmpty()) {
+        if (feederStopper.joinable()) {
+          feederStopper.join();
+        }
         finishRun();
         return;
       }
     }
     _TYPED_TRANSACTION item;
-    // An item without a transaction only wakes the loop (Shutdown queues one).
-    const bool got = newQueue->Get(item, kQueueWaitMillis) == 0 && item.transaction != nullptr;
+    // An item without a transaction only wakes the loop (Shutdown queues one). While the feeder
+    // stops, wait briefly so its end is noticed at once.
+    const long wait = shutdownSeen ? kShutdownWaitMillis : kQueueWaitMillis;
+    const bool got = newQueue->Get(item, wait) == 0 && item.transaction != nullptr;
     if (got && item.type != TRANSACTION_KIND_DPX) {
       CLOG::min(
           "This transaction of type[%d] is not for this Analyzer[%d], it needs to be converted",

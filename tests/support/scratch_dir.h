@@ -1,6 +1,7 @@
 #pragma once
 
-// Test helper: a scratch directory from mkdtemp("/tmp/q7test-XXXXXX") (no '.' in its path),
+// Test helper: a scratch directory from mkdtemp("/tmp/q7test_XXXXXX"): no '.' or
+// '-' in its path, which would upset the order of collector files kept there;
 // removed with its contents on destruction. Header-only so every test binary can use it.
 
 #include <stdlib.h>
@@ -16,7 +17,7 @@ namespace q7test {
 class ScratchDir {
  public:
   ScratchDir() {
-    char tmpl[] = "/tmp/q7test-XXXXXX";
+    char tmpl[] = "/tmp/q7test_XXXXXX";
     if (::mkdtemp(tmpl) == nullptr) {
       throw std::runtime_error("mkdtemp failed");
     }
