@@ -60,12 +60,13 @@ tsan: deps
 	cd build-tsan && ctest --output-on-failure -j $(JOBS) -L unit --timeout 300
 
 # The concurrency code under ThreadSanitizer (part of make test): the runtime primitives, the
-# situation controller shared by framework threads and the analyzer, and the analyzer thread.
+# situation controller shared by framework threads and the analyzer, the analyzer thread, and
+# the intake threads (data file monitors and the file manager).
 test-tsan: deps
 	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON
 	cmake --build build-tsan -j $(JOBS) --target runtime_test analyzer_test
 	build-tsan/bin/runtime_test --gtest_brief=1
-	build-tsan/bin/analyzer_test --gtest_brief=1 --gtest_filter='Situation*:Processing*:WaitFor*'
+	build-tsan/bin/analyzer_test --gtest_brief=1 --gtest_filter='Situation*:Processing*:WaitFor*:DataFileMonitor*:FileManager*'
 
 bench: deps
 	cmake -S . -B build-release $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Release -DQ7_BUILD_TESTS=OFF

@@ -12,11 +12,12 @@ namespace tama {
 namespace {
 
 // The exported row tables the analyzer answers.
-#define Q7_ANALYZER_ROW_TABLES(X)                                                                  \
-  X(appot)                                                                                         \
-  X(appsm)                                                                                         \
-  X(clntapp) X(clntot) X(clntsm) X(clntsrv) X(srvappsm) X(srvot) X(srvsm) X(txins) X(txot) X(txsm) \
-      X(txcs) X(appcs) X(clntcs) X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
+#define Q7_ANALYZER_ROW_TABLES(X)                                                               \
+  X(appot)                                                                                      \
+  X(appsm)                                                                                      \
+  X(clntapp)                                                                                    \
+  X(clntot) X(clntsm) X(clntsrv) X(srvappsm) X(srvot) X(srvsm) X(txins) X(txot) X(txsm) X(txcs) \
+      X(appcs) X(clntcs) X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
 
 void installRowQueries() {
 #define Q7_ROW_QUERY(name)                                                       \

@@ -107,11 +107,13 @@ void prepare_startup(int /*argc*/, char** /*argv*/) {
   CConfig::setBaseDirectory(AgentProperties::getAgentProperty("AgentBaseDir").c_str());
   const std::string dpx_path = AgentProperties::getAgentProperty("KQ7DPXLOGPATH");
   CConfig::setDpxDataDirectory(dpx_path.c_str());
-  if (dpx_path.find('.') != std::string::npos) {
-    // File order and renamed-file lookup cut names at the first '.' of the whole path.
+  if (dpx_path.find_first_of(".-") != std::string::npos) {
+    // File order and renamed-file lookup cut names at the first '.' of the whole path and take
+    // any '-' in it for the mark of a renamed file.
     Q7_TRACE(kUnit, fw::kTraceError,
-             "Warning: KQ7DPXLOGPATH \"%s\" contains a '.'; collector files in it will be "
-             "ordered wrongly. Move the data directory to a path without dots.",
+             "Warning: KQ7DPXLOGPATH \"%s\" contains a '.' or '-'; collector files in it will be "
+             "ordered wrongly and renamed files missed. Move the data directory to a path "
+             "without them.",
              dpx_path.c_str());
   }
   CConfig::setOverTimeInterval(static_cast<int>(

@@ -14,79 +14,13 @@
 #include <vector>
 
 #include "core/analyzer/situation_controller.h"
+#include "tests/agent_fixture.h"
 #include "tests/agent_process.h"
 
 namespace q7test {
 namespace {
 
 using namespace std::chrono_literals;
-
-class AgentE2ETest : public ::testing::Test {
- protected:
-  std::map<std::string, std::string> env() const {
-    std::map<std::string, std::string> vars = {
-        {"Q7_HOME", home_.path()}, {"Q7_HTTP_ADDRESS", "127.0.0.1:0"},
-        {"Q7_TRACE", "*=ALL"},     {"Q7_TRACE_FILE", ""},
-        {"DPX_NOSTART", ""},       {"TZ", "UTC"}};
-    vars.insert(extraEnv_.begin(), extraEnv_.end());
-    return vars;
-  }
-  std::string tracePath() const { return home_.path() + "logs/q7agent.log"; }
-  std::string trace() const { return readFile(tracePath()); }
-  std::string base() const { return home_.path() + "zorvan6/"; }
-
-  // Starts the agent and waits until its API answers; returns the bound address.
-  std::string start() {
-    agent_ = std::make_unique<AgentProcess>(std::vector<std::string>{}, env());
-    std::string address;
-    const bool up = waitFor(
-        [&] {
-          address = readFile(home_.path() + "logs/q7agent.addr");
-          if (address.empty() || address.back() != '\n') {
-            return false;
-          }
-          address.pop_back();
-          return true;
-        },
-        10s);
-    EXPECT_TRUE(up) << trace();
-    return address;
-  }
-
-  nlohmann::json get(const std::string& address, const std::string& path, int* status) {
-    httplib::Client client("http://" + address);
-    client.set_connection_timeout(2);
-    auto res = client.Get(path.c_str());
-    if (!res) {
-      *status = -1;
-      return {};
-    }
-    *status = res->status;
-    return nlohmann::json::parse(res->body, nullptr, false);
-  }
-
-  // Sends sig and checks the exit status 0 within 2 seconds.
-  void stopWith(int sig) {
-    const auto sent = std::chrono::steady_clock::now();
-    agent_->signal(sig);
-    const auto status = agent_->wait(5s);
-    ASSERT_TRUE(status.has_value()) << "agent did not exit";
-    EXPECT_LT(std::chrono::steady_clock::now() - sent, 2s);
-    ASSERT_TRUE(WIFEXITED(*status)) << "status " << *status;
-    EXPECT_EQ(0, WEXITSTATUS(*status));
-  }
-
-  // The body of a GET as text (CSV replies).
-  std::string getText(const std::string& address, const std::string& path) {
-    httplib::Client client("http://" + address);
-    auto res = client.Get(path.c_str());
-    return res ? res->body : std::string();
-  }
-
-  TempHome home_;
-  std::unique_ptr<AgentProcess> agent_;
-  std::map<std::string, std::string> extraEnv_;
-};
 
 // --help and --version print, exit 0 and create nothing in the home.
 TEST_F(AgentE2ETest, HelpAndVersionStartNothing) {
@@ -247,17 +181,14 @@ TEST_F(AgentE2ETest, BadConfigurationIsTracedNotFatal) {
   EXPECT_NE(std::string::npos, t.find("Invalid Overtime Interval 0"));
 }
 
-// Transactions read from the collector's data directory reach the summary, current-status and instance tables
-// with the counts of sm3gen's truth; a filter and CSV work on them.
+// Transactions read from the collector's data directory reach the summary, current-status and
+// instance tables with the counts of sm3gen's truth; a filter and CSV work on them.
 TEST_F(AgentE2ETest, FedTransactionsReachTheTables) {
   // Keep the whole test inside one 5-minute interval, so current-status rows hold everything.
   while (time(nullptr) % 300 > 280) {
     std::this_thread::sleep_for(1s);
   }
-  const std::string data = home_.path() + "data/feed.sm3";
-  home_.writeFile("config/" + shortHostName() + "_q7.cfg",
-                  "[AGENT]\nKQ7DPXLOGPATH=" + home_.path() + "data\n");
-  std::filesystem::create_directories(home_.path() + "data");
+  const std::string data = useDataDirectory() + "/feed.sm3";
   const std::string truthPath = home_.path() + "truth.json";
   const std::string command = std::string(SM3GEN_PATH) + " --out " + data + " --truth " +
                               truthPath + " --records 400 --sites 2 --seed 3 --rate 1000 --start " +
@@ -269,30 +200,10 @@ TEST_F(AgentE2ETest, FedTransactionsReachTheTables) {
     pages += figures["pages"]["count"].get<long>();
   }
   ASSERT_GT(pages, 10);
-  {
-    // One catch-all pattern keeping every name, collecting every instance.
-    CSituationController controller(base() + "odi/dpx");
-    auto pattern = std::make_unique<TransactionPattern>();
-    setPatternText(pattern->applicationName, "All");
-    setPatternText(pattern->applicationPattern, "*");
-    setPatternText(pattern->transactionName, "All");
-    setPatternText(pattern->transactionPattern, "*");
-    setPatternText(pattern->situationId, "everything");
-    pattern->aggappsuniq = 1;
-    pattern->aggtxsuniq = 1;
-    pattern->collectInstances = 1;
-    pattern->mrtthres = 10000000;
-    ASSERT_TRUE(controller.addTransactionPattern(std::move(pattern)));
-  }
+  registerCatchAllPattern();
   const std::string address = start();
 
-  auto total = [](const nlohmann::json& body) {
-    long sum = 0;
-    for (const auto& row : body["rows"]) {
-      sum += row["totreq"].get<long>();
-    }
-    return sum;
-  };
+  const auto total = &AgentE2ETest::totalRequests;
   int status = 0;
   nlohmann::json summary;
   EXPECT_TRUE(waitFor(

@@ -89,7 +89,8 @@ std::unique_ptr<char[]> CDataFileMonitor::getNewFileContents(long* length, long 
     CLOG::error("%s fseek to offset[%lld] failed errno[%d]", kWhere, offset, errno);
     return nullptr;
   }
-  const long got = static_cast<long>(std::fread(buffer.get(), 1, static_cast<size_t>(count), in.get()));
+  const long got =
+      static_cast<long>(std::fread(buffer.get(), 1, static_cast<size_t>(count), in.get()));
   if (got != count) {
     CLOG::error(
         "%s ERROR: Read from file failed, attempted to read in [%ld] bytes and only read in [%ld] "

@@ -1,10 +1,10 @@
 #include "core/analyzer/dpx_analyzer.h"
 
-#include <cstring>
 #include <atomic>
+#include <cstring>
 #include <mutex>
-#include <thread>
 #include <string>
+#include <thread>
 
 #include "core/analyzer/dpx_transaction.h"
 #include "core/analyzer/situation_controller.h"

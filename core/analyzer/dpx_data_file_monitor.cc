@@ -149,9 +149,10 @@ bool CDPXDataFileMonitor::handleLegacyDPXRename() {
   if (renamed) {
     char newName[kFileInfoMaxPath + 1];
     if (getNewLegacyFilename(getFile(), newName, sizeof(newName))) {
-      CLOG::min("Found new file name [%s] for previous file [%s]. Will process any remaining "
-                "records.",
-                newName, getFile());
+      CLOG::min(
+          "Found new file name [%s] for previous file [%s]. Will process any remaining "
+          "records.",
+          newName, getFile());
       processStatically(newName, getLastProcessedOffset(), getExcludeOutlierMillis(), analyzer);
     }
     setLastProcessedOffset(0);

@@ -58,8 +58,9 @@ class CDPXDataFileMonitor : public CDataFileMonitor {
   // it, as the file manager and the rename handling do. The monitor gets excludeOutlierMillis
   // and analyzer (null: the process's). Returns the monitor's final state (stopped and joined)
   // so the caller can see where it got to.
-  static std::unique_ptr<CDPXDataFileMonitor> processStatically(const char* file, long long offset, int excludeOutlierMillis,
-                                CAnalyzer* analyzer);
+  static std::unique_ptr<CDPXDataFileMonitor> processStatically(const char* file, long long offset,
+                                                                int excludeOutlierMillis,
+                                                                CAnalyzer* analyzer);
 
  protected:
   void Run() override;

@@ -58,7 +58,7 @@ class CDPXFileManager : public CFileManager, public CAnalyzerFeeder {
   void stopCurrentMonitor(bool finishFile);
   void setLastProcessed(const char* file, long long offset);
 
-  std::string lastProcessedFile;    // at most 4096 characters; empty: none
+  std::string lastProcessedFile;  // at most 4096 characters; empty: none
   long long lastProcessedOffset = 0;
   std::unique_ptr<CDPXDataFileMonitor> currentMonitor;
 };

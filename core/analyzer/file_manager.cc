@@ -138,9 +138,10 @@ _LAST_FILE_INFO* CFileManager::getLastProcessedFile() {
     LastFileInfoBytes bytes{};
     const long got = readFully(fd.get(), bytes.data(), kLastFileInfoRecordSize);
     if (got < kLastFileInfoRecordSize) {
-      CLOG::max("%s read of [%d] bytes failed, only read in [%d].  May be because of end of file "
-                "and not an error.",
-                kWhere, kLastFileInfoRecordSize, static_cast<int>(got));
+      CLOG::max(
+          "%s read of [%d] bytes failed, only read in [%d].  May be because of end of file "
+          "and not an error.",
+          kWhere, kLastFileInfoRecordSize, static_cast<int>(got));
       break;
     }
     auto* record = new (std::nothrow) _LAST_FILE_INFO;

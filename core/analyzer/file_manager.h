@@ -60,9 +60,9 @@ class CFileManager : public CvelThread {
 
  private:
   char dirToWatch[kFileInfoMaxPath + 1] = {};  // set at construction, then by the owner
-  int excludeOutlierMillis = -1;                // ms; -1: no test
-  std::atomic<bool> stopRequested{false};       // set by Shutdown, read by the loop
-  CAnalyzer* analyzer = nullptr;                // not owned
-  const int32_t persistRecordType = 1;          // first word of every persisted record
-  std::atomic<bool> shutdownComplete{false};    // set when the loop has returned
+  int excludeOutlierMillis = -1;               // ms; -1: no test
+  std::atomic<bool> stopRequested{false};      // set by Shutdown, read by the loop
+  CAnalyzer* analyzer = nullptr;               // not owned
+  const int32_t persistRecordType = 1;         // first word of every persisted record
+  std::atomic<bool> shutdownComplete{false};   // set when the loop has returned
 };

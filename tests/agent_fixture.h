@@ -1,0 +1,131 @@
+#pragma once
+
+// Test fixture for end-to-end tests: the real q7agent in a temporary home, started with an
+// environment that keeps it self-contained (free port, no collector processes, every trace
+// class into the home's log), and helpers to read its HTTP API.
+
+#include <gtest/gtest.h>
+#include <httplib.h>
+#include <sys/wait.h>
+
+#include <chrono>
+#include <cstdio>
+#include <filesystem>
+#include <map>
+#include <memory>
+#include <nlohmann/json.hpp>
+#include <string>
+#include <vector>
+
+#include "core/analyzer/situation_controller.h"
+#include "tests/agent_process.h"
+
+namespace q7test {
+
+using namespace std::chrono_literals;
+
+class AgentE2ETest : public ::testing::Test {
+ protected:
+  std::map<std::string, std::string> env() const {
+    std::map<std::string, std::string> vars = {
+        {"Q7_HOME", home_.path()}, {"Q7_HTTP_ADDRESS", "127.0.0.1:0"},
+        {"Q7_TRACE", "*=ALL"},     {"Q7_TRACE_FILE", ""},
+        {"DPX_NOSTART", ""},       {"TZ", "UTC"}};
+    vars.insert(extraEnv_.begin(), extraEnv_.end());
+    return vars;
+  }
+  std::string tracePath() const { return home_.path() + "logs/q7agent.log"; }
+  std::string trace() const { return readFile(tracePath()); }
+  std::string base() const { return home_.path() + "zorvan6/"; }
+
+  // Points the agent's collector data directory at <home>data (created); returns it with no
+  // trailing '/'.
+  std::string useDataDirectory() {
+    const std::string data = home_.path() + "data";
+    home_.writeFile("config/" + shortHostName() + "_q7.cfg",
+                    "[AGENT]\nKQ7DPXLOGPATH=" + data + "\n");
+    std::filesystem::create_directories(data);
+    return data;
+  }
+
+  // Registers, before start, one catch-all transaction pattern that keeps every application and
+  // transaction name and collects every instance.
+  void registerCatchAllPattern() {
+    CSituationController controller(base() + "odi/dpx");
+    auto pattern = std::make_unique<TransactionPattern>();
+    setPatternText(pattern->applicationName, "All");
+    setPatternText(pattern->applicationPattern, "*");
+    setPatternText(pattern->transactionName, "All");
+    setPatternText(pattern->transactionPattern, "*");
+    setPatternText(pattern->situationId, "everything");
+    pattern->aggappsuniq = 1;
+    pattern->aggtxsuniq = 1;
+    pattern->collectInstances = 1;
+    pattern->mrtthres = 10000000;
+    ASSERT_TRUE(controller.addTransactionPattern(std::move(pattern)));
+  }
+
+  // The sum of totreq over a sample's rows.
+  static long totalRequests(const nlohmann::json& body) {
+    long sum = 0;
+    for (const auto& row : body["rows"]) {
+      sum += row["totreq"].get<long>();
+    }
+    return sum;
+  }
+
+  // Starts the agent and waits until its API answers; returns the bound address.
+  std::string start() {
+    std::remove((home_.path() + "logs/q7agent.addr").c_str());
+    agent_ = std::make_unique<AgentProcess>(std::vector<std::string>{}, env());
+    std::string address;
+    const bool up = waitFor(
+        [&] {
+          address = readFile(home_.path() + "logs/q7agent.addr");
+          if (address.empty() || address.back() != '\n') {
+            return false;
+          }
+          address.pop_back();
+          return true;
+        },
+        10s);
+    EXPECT_TRUE(up) << trace();
+    return address;
+  }
+
+  nlohmann::json get(const std::string& address, const std::string& path, int* status) {
+    httplib::Client client("http://" + address);
+    client.set_connection_timeout(2);
+    auto res = client.Get(path.c_str());
+    if (!res) {
+      *status = -1;
+      return {};
+    }
+    *status = res->status;
+    return nlohmann::json::parse(res->body, nullptr, false);
+  }
+
+  // Sends sig and checks the exit status 0 within 2 seconds.
+  void stopWith(int sig) {
+    const auto sent = std::chrono::steady_clock::now();
+    agent_->signal(sig);
+    const auto status = agent_->wait(5s);
+    ASSERT_TRUE(status.has_value()) << "agent did not exit";
+    EXPECT_LT(std::chrono::steady_clock::now() - sent, 2s);
+    ASSERT_TRUE(WIFEXITED(*status)) << "status " << *status;
+    EXPECT_EQ(0, WEXITSTATUS(*status));
+  }
+
+  // The body of a GET as text (CSV replies).
+  std::string getText(const std::string& address, const std::string& path) {
+    httplib::Client client("http://" + address);
+    auto res = client.Get(path.c_str());
+    return res ? res->body : std::string();
+  }
+
+  TempHome home_;
+  std::unique_ptr<AgentProcess> agent_;
+  std::map<std::string, std::string> extraEnv_;
+};
+
+}  // namespace q7test
