@@ -14,6 +14,10 @@
 
 namespace {
 
+// How long a reader pauses when it finds the queue full: at a few microseconds per
+// transaction the analyzer takes several hundred items meanwhile and never runs dry.
+constexpr unsigned long kFullQueuePauseMillis = 1;
+
 long IntervalSeconds() {
   return static_cast<long>(CConfig::getOverTimeInterval()) * 60;
 }
@@ -36,7 +40,14 @@ bool CAnalyzer::add(_TYPED_TRANSACTION item) {
     newQueue = std::make_unique<TvelQueue<_TYPED_TRANSACTION>>();
     return false;
   }
-  // Put waits while the queue is full, holding the reader back rather than dropping records.
+  // A full queue means the analyzer is behind: let it drain a stretch before queueing again.
+  // Blocking in Put instead would wake this thread for every item the analyzer takes, and the
+  // two threads would hand the processor to each other once per transaction.
+  while (newQueue->IsFull() && !shutdownRequested.load()) {
+    CMisc::sleep(kFullQueuePauseMillis);
+  }
+  // Put still waits while the queue is full, holding the reader back rather than dropping
+  // records.
   const long status = newQueue->Put(item);
   if (status != 0) {
     CLOG::min("%s ERROR, Failed[%d] to add to newQueue", kWhere, static_cast<int>(status));
