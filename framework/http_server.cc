@@ -13,8 +13,11 @@
 #include <vector>
 
 #include "framework/agent_runtime.h"
+#include "framework/api_token.h"
+#include "framework/http_json.h"
 #include "framework/runtime_state.h"
 #include "framework/sample_query.h"
+#include "framework/situations_api.h"
 #include "framework/status.h"
 #include "framework/table_sample.h"
 #include "framework/tables.h"
@@ -28,18 +31,6 @@ constexpr std::size_t kMaxBodyBytes = 64 * 1024;
 constexpr std::size_t kWorkerThreads = 16;
 
 const auto kProcessStart = std::chrono::steady_clock::now();
-
-// Table rows and echoed request text need not be valid UTF-8; a strict dump would throw.
-template <typename Json>
-void ReplyJson(httplib::Response& res, int status, const Json& body) {
-  res.status = status;
-  res.set_content(body.dump(2, ' ', false, Json::error_handler_t::replace) + "\n",
-                  "application/json");
-}
-
-void ReplyError(httplib::Response& res, int status, const std::string& message) {
-  ReplyJson(res, status, nlohmann::json{{"error", message}});
-}
 
 nlohmann::json AgentInfo() {
   nlohmann::json info;
@@ -181,8 +172,22 @@ bool HttpServer::ParseAddress(const std::string& address, std::string* host, int
   return true;
 }
 
-void HttpServer::InstallRoutes() {
+void HttpServer::InstallRoutes(bool loopback) {
   httplib::Server& s = *server_;
+  // Changes always need the token; on an address others can reach, so does reading.
+  s.set_pre_routing_handler([this, loopback](const httplib::Request& req, httplib::Response& res) {
+    const bool change = req.method != "GET" && req.method != "HEAD";
+    if ((change || !loopback) &&
+        !BearerMatches(req.get_header_value("Authorization"), api_token_)) {
+      Q7_TRACE(kUnit, kTraceError, "%s %s refused: missing or wrong bearer token",
+               req.method.c_str(), req.path.c_str());
+      ReplyError(res, 401,
+                 "this request needs \"Authorization: Bearer <token>\" with the token "
+                 "in the configuration directory's q7_api_token");
+      return httplib::Server::HandlerResponse::Handled;
+    }
+    return httplib::Server::HandlerResponse::Unhandled;
+  });
   s.new_task_queue = [] { return new httplib::ThreadPool(kWorkerThreads); };
   s.set_keep_alive_timeout(1);
   s.set_payload_max_length(kMaxBodyBytes);
@@ -218,6 +223,7 @@ void HttpServer::InstallRoutes() {
   s.Get("/api/v1/tables",
         [](const httplib::Request&, httplib::Response& res) { ReplyJson(res, 200, Tables()); });
   s.Get(R"(/api/v1/tables/([A-Za-z0-9_]+))", ServeSample);
+  InstallSituationRoutes(s);
 }
 
 int HttpServer::Start(const std::string& address, std::string* error) {
@@ -231,7 +237,7 @@ int HttpServer::Start(const std::string& address, std::string* error) {
     *error = "\"" + address + "\" is not an address of the form host:port";
     return kInvalidArgument;
   }
-  InstallRoutes();
+  InstallRoutes(IsLoopbackHost(host));
   if (port == 0) {
     port = server_->bind_to_any_port(host.c_str());
     if (port < 0) {

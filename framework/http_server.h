@@ -9,6 +9,7 @@
 #include <memory>
 #include <string>
 #include <thread>
+#include <utility>
 
 namespace httplib {
 class Server;
@@ -28,6 +29,10 @@ class HttpServer {
   // not parse, or kIoError when the address cannot be bound; *error says why.
   int Start(const std::string& address, std::string* error);
 
+  // The bearer token changes need (and, on a non-loopback address, every request). Empty: no
+  // request that needs it is allowed. Call before Start.
+  void SetApiToken(std::string token) { api_token_ = std::move(token); }
+
   // Stops serving and waits for requests in flight. Safe to call when not started.
   void Stop();
 
@@ -38,11 +43,12 @@ class HttpServer {
   static bool ParseAddress(const std::string& address, std::string* host, int* port);
 
  private:
-  void InstallRoutes();
+  void InstallRoutes(bool loopback);
 
   std::unique_ptr<httplib::Server> server_;
   std::thread thread_;
   std::string bound_address_;
+  std::string api_token_;  // set before Start, then read by the pool threads
 };
 
 }  // namespace fw

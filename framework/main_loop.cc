@@ -8,9 +8,11 @@
 #include <string>
 
 #include "framework/agent_runtime.h"
+#include "framework/api_token.h"
 #include "framework/environment.h"
 #include "framework/http_server.h"
 #include "framework/runtime_state.h"
+#include "framework/situations.h"
 #include "framework/status.h"
 #include "framework/trace.h"
 
@@ -62,12 +64,30 @@ int kunmain(int /*argc*/, char** /*argv*/) {
     Q7_TRACE(kUnit, fw::kTraceError, "no agent loader is registered");
   }
 
+  std::string error;
+  std::string config_dir;
+  std::string token;
+  if (fw::GetConfigDirectory(&config_dir) == fw::kOk) {
+    ::mkdir(config_dir.c_str(), 0755);  // a first start in a fresh home
+    fw::SetSituationsFile(config_dir + "q7_situations.json");
+    const int restored = fw::RestoreSituations();
+    Q7_TRACE(kUnit, fw::kTraceSummary, "%d situations restored", restored);
+    if (fw::LoadOrCreateApiToken(config_dir + "q7_api_token", &token, &error) != fw::kOk) {
+      // Reading still works on a loopback address; changes are refused until this is fixed.
+      fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__, "%s", error.c_str());
+    }
+  } else {
+    fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__,
+                          "no configuration directory: situations are not kept across restarts "
+                          "and the API accepts no changes");
+  }
+
   std::string address;
   if (!fw::GetEnv("Q7_HTTP_ADDRESS", &address) || address.empty()) {
     address = kDefaultHttpAddress;
   }
   fw::HttpServer server;
-  std::string error;
+  server.SetApiToken(token);
   std::string address_file;
   if (server.Start(address, &error) == fw::kOk) {
     Q7_TRACE(kUnit, fw::kTraceSummary, "HTTP API listening on %s", server.bound_address().c_str());
@@ -91,5 +111,7 @@ int kunmain(int /*argc*/, char** /*argv*/) {
   if (!address_file.empty()) {
     std::remove(address_file.c_str());
   }
+  // Stopping the agent never stops a situation: drop them without their destructors.
+  fw::ResetSituations();
   return 0;
 }

@@ -1,5 +1,7 @@
 #include "framework/request.h"
 
+#include <cctype>
+
 #include "framework/status.h"
 
 namespace fw {
@@ -20,6 +22,22 @@ std::string_view ConditionOpName(ConditionOp op) {
       return "GE";
   }
   return "?";
+}
+
+bool ParseConditionOp(std::string_view text, ConditionOp* op) {
+  for (const ConditionOp candidate : {ConditionOp::kEQ, ConditionOp::kNE, ConditionOp::kLT,
+                                      ConditionOp::kLE, ConditionOp::kGT, ConditionOp::kGE}) {
+    const std::string_view name = ConditionOpName(candidate);
+    bool same = name.size() == text.size();
+    for (std::size_t i = 0; same && i < name.size(); ++i) {
+      same = std::toupper(static_cast<unsigned char>(text[i])) == name[i];
+    }
+    if (same) {
+      *op = candidate;
+      return true;
+    }
+  }
+  return false;
 }
 
 int AddRows(Request* request, const void* rows, std::size_t row_size, int count) {

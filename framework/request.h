@@ -20,6 +20,8 @@ enum class ConditionOp { kEQ, kNE, kLT, kLE, kGT, kGE };
 
 // "EQ", "NE", ... for traces and messages.
 std::string_view ConditionOpName(ConditionOp op);
+// The operator named text ("EQ" ... "GE", any case); false when there is none.
+bool ParseConditionOp(std::string_view text, ConditionOp* op);
 
 // One filter condition of a request.
 struct Condition {

@@ -12,22 +12,6 @@
 namespace fw {
 namespace {
 
-constexpr std::array kOps = {ConditionOp::kEQ, ConditionOp::kNE, ConditionOp::kLT,
-                             ConditionOp::kLE, ConditionOp::kGT, ConditionOp::kGE};
-
-bool SameLetters(std::string_view a, std::string_view b) {
-  if (a.size() != b.size()) {
-    return false;
-  }
-  for (std::size_t i = 0; i < a.size(); ++i) {
-    if (std::tolower(static_cast<unsigned char>(a[i])) !=
-        std::tolower(static_cast<unsigned char>(b[i]))) {
-      return false;
-    }
-  }
-  return true;
-}
-
 // The same rule the row filter applies: optional blanks around a decimal that fits 64 bits.
 bool IsWholeNumber(std::string_view text) {
   const auto first = text.find_first_not_of(' ');
@@ -75,13 +59,8 @@ int ParseWhere(std::string_view text, std::span<const ColumnInfo> columns, Condi
     *error = "where: unknown column \"" + std::string(column_name) + "\"";
     return kInvalidArgument;
   }
-  const ConditionOp* op = nullptr;
-  for (const ConditionOp& candidate : kOps) {
-    if (SameLetters(op_name, ConditionOpName(candidate))) {
-      op = &candidate;
-    }
-  }
-  if (op == nullptr) {
+  ConditionOp op = ConditionOp::kEQ;
+  if (!ParseConditionOp(op_name, &op)) {
     *error = "where: unknown operator \"" + std::string(op_name) + "\" (EQ NE LT LE GT GE)";
     return kInvalidArgument;
   }
@@ -90,7 +69,7 @@ int ParseWhere(std::string_view text, std::span<const ColumnInfo> columns, Condi
              std::string(value) + "\" is not a whole number";
     return kInvalidArgument;
   }
-  *condition = Condition{column->name, *op, std::string(value), -1};
+  *condition = Condition{column->name, op, std::string(value), -1};
   return kOk;
 }
 

@@ -8,11 +8,12 @@
 //   kq7_<table>_agent              q7tema::TableAgent, derived from kq7_<table>_base
 //
 // The templates are instantiated once, in exported_tables.cc. To give one table behaviour of
-// its own, specialise TableAgent<kq7_<table>_data_t> and declare the specialisation before the
-// instantiations there.
+// its own, specialise TableAgent<kq7_<table>_data_t> in a header included above the
+// declarations below (the pattern tables do so in pattern_tables.h).
 //
 // Thread safety: the init functions run on the agent loader's thread; see the class headers.
 
+#include "q7tema/pattern_tables.h"
 #include "q7tema/table_manager.h"
 
 #define Q7_DECLARE_TABLE_CLASSES(lower, exported, COLUMNS)                  \

@@ -2,6 +2,7 @@
 
 #include "core/analyzer/dpx_analyzer.h"
 #include "core/analyzer/dpx_file_manager.h"
+#include "q7tema/pattern_tables.h"
 #include "q7tema/row_query.h"
 #include "tama/agent_details.h"
 #include "tama/agent_hooks.h"
@@ -12,12 +13,13 @@ namespace tama {
 namespace {
 
 // The exported row tables the analyzer answers.
-#define Q7_ANALYZER_ROW_TABLES(X)                                                               \
-  X(appot)                                                                                      \
-  X(appsm)                                                                                      \
-  X(clntapp)                                                                                    \
-  X(clntot) X(clntsm) X(clntsrv) X(srvappsm) X(srvot) X(srvsm) X(txins) X(txot) X(txsm) X(txcs) \
-      X(appcs) X(clntcs) X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
+#define Q7_ANALYZER_ROW_TABLES(X)                                                              \
+  X(appot)                                                                                     \
+  X(appsm)                                                                                     \
+  X(clntapp)                                                                                   \
+  X(clntot)                                                                                    \
+  X(clntsm) X(clntsrv) X(srvappsm) X(srvot) X(srvsm) X(txins) X(txot) X(txsm) X(txcs) X(appcs) \
+      X(clntcs) X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
 
 void installRowQueries() {
 #define Q7_ROW_QUERY(name)                                                       \
@@ -27,6 +29,42 @@ void installRowQueries() {
   Q7_ANALYZER_ROW_TABLES(Q7_ROW_QUERY)
 #undef Q7_ROW_QUERY
   q7tema::SetRowQuery<kq7_q7agntdts_data_t>(&getAgentDetailRows);
+  q7tema::SetRowQuery<kq7_q7txptns_data_t>([](int sampleType, int* count) {
+    return CDPXAnalyzer::GetInstanceNoStart()->getTransactionPatterns(sampleType, count);
+  });
+  q7tema::SetRowQuery<kq7_q7clntptns_data_t>([](int sampleType, int* count) {
+    return CDPXAnalyzer::GetInstanceNoStart()->getClientPatterns(sampleType, count);
+  });
+}
+
+// Situations on the pattern tables reach the analyzer's situation controller.
+void installPatternHooks() {
+  q7tema::PatternHooks hooks;
+  hooks.registerTransaction = [](const char* situation, const char* applicationName,
+                                 const char* applicationPattern, const char* transactionName,
+                                 const char* transactionPattern, int16_t aggapsuniq,
+                                 int16_t aggtxsuniq, int16_t collinstcs, int32_t sampercent,
+                                 int32_t mrtthres, int16_t importance) {
+    return CDPXAnalyzer::GetInstanceNoStart()->newTransactionPattern(
+        situation, applicationName, applicationPattern, transactionName, transactionPattern,
+        aggapsuniq, aggtxsuniq, collinstcs, sampercent, mrtthres, importance);
+  };
+  hooks.deregisterTransaction = [](const char* situation) {
+    return CDPXAnalyzer::GetInstanceNoStart()->removeTransactionPattern(situation);
+  };
+  hooks.registerClient = [](const char* situation, const char* clientName,
+                            const char* hostNamePattern, const char* ipAddressPattern,
+                            int16_t agguniqly) {
+    return CDPXAnalyzer::GetInstanceNoStart()->newClientPattern(
+        situation, clientName, hostNamePattern, ipAddressPattern, agguniqly);
+  };
+  hooks.deregisterClient = [](const char* situation) {
+    return CDPXAnalyzer::GetInstanceNoStart()->removeClientPattern(situation);
+  };
+  hooks.sendMessage = [](const char* key, int severity, const char* situation) {
+    AgentMessage::sendMessage(key, severity, {situation});
+  };
+  q7tema::SetPatternHooks(std::move(hooks));
 }
 
 }  // namespace
@@ -41,6 +79,7 @@ void installAgentHooks() {
     AgentMessage::sendMessage(key, severity, args);
   };
   installRowQueries();
+  installPatternHooks();
   // The file manager tails the collector's data directory for the analyzer.
   CDPXAnalyzer::setFeederFactory([](const char* dataDirectory) {
     auto manager = std::make_unique<CDPXFileManager>();

@@ -92,6 +92,11 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   kq7_q7clntcs_data_t* get_tblclntcs(int sampleType, int* count);
   kq7_q7srvcs_data_t* get_tblsrvcs(int sampleType, int* count);
 
+  // The registered patterns as pattern-table rows, in matching order (pattern_rows.cc). Only
+  // sample type 3 yields rows; new[] arrays as above. Any thread.
+  kq7_q7txptns_data_t* getTransactionPatterns(int sampleType, int* count);
+  kq7_q7clntptns_data_t* getClientPatterns(int sampleType, int* count);
+
   // Intervals in the summary period: summary hours x 60 / over-time minutes.
   static int summaryIntervals();
 

@@ -1,0 +1,336 @@
+#include "framework/situations.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <charconv>
+#include <cstdint>
+#include <cstdio>
+#include <cstring>
+#include <fstream>
+#include <iterator>
+#include <limits>
+#include <memory>
+#include <mutex>
+#include <nlohmann/json.hpp>
+#include <utility>
+
+#include "framework/row_filter.h"
+#include "framework/status.h"
+#include "framework/table_manager.h"
+#include "framework/tables.h"
+#include "framework/trace.h"
+
+namespace fw {
+namespace {
+
+constexpr char kUnit[] = "situations";
+constexpr int kSituationRequestType = 4;
+
+// A started situation: what was asked, and the request and agent object serving it.
+struct Started {
+  SituationInfo info;
+  std::unique_ptr<Request> request;              // outlives agent
+  std::unique_ptr<TableAgent> agent;             // created by the table's manager
+  std::shared_ptr<const TableDefinition> table;  // keeps the manager alive for agent
+};
+
+struct Registry {
+  std::mutex mutex;
+  // mutex guards the following.
+  std::vector<Started> started;  // in the order started
+  std::string file;              // where the list is persisted; empty: nowhere
+};
+
+Registry& TheRegistry() {
+  static Registry registry;
+  return registry;
+}
+
+bool ValidName(std::string_view name) {
+  if (name.empty() || name.size() > kMaxSituationNameLength) {
+    return false;
+  }
+  for (const char c : name) {
+    const bool ok = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') ||
+                    c == '_' || c == '-' || c == '.';
+    if (!ok) {
+      return false;
+    }
+  }
+  return true;
+}
+
+// The range of an integer column of width bytes.
+bool FitsColumn(std::int64_t value, int width) {
+  if (width == 2) {
+    return value >= std::numeric_limits<std::int16_t>::min() &&
+           value <= std::numeric_limits<std::int16_t>::max();
+  }
+  return value >= std::numeric_limits<std::int32_t>::min() &&
+         value <= std::numeric_limits<std::int32_t>::max();
+}
+
+bool ParseInteger(std::string_view text, std::int64_t* value) {
+  const auto first = text.find_first_not_of(' ');
+  const auto last = text.find_last_not_of(' ');
+  if (first == std::string_view::npos) {
+    return false;
+  }
+  text = text.substr(first, last - first + 1);
+  if (!text.empty() && text.front() == '+') {
+    text.remove_prefix(1);
+  }
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), *value);
+  return error == std::errc() && end == text.data() + text.size();
+}
+
+nlohmann::ordered_json ToJson(const SituationInfo& info) {
+  nlohmann::ordered_json conditions = nlohmann::ordered_json::array();
+  for (const Condition& c : info.conditions) {
+    conditions.push_back(
+        {{"column", c.column}, {"op", std::string(ConditionOpName(c.op))}, {"value", c.value}});
+  }
+  return {{"name", info.name}, {"table", info.table}, {"conditions", std::move(conditions)}};
+}
+
+// Writes the list to the file: a temporary file in the same directory, flushed, then renamed,
+// so a crash leaves the old list or the new one, never half of one. Registry mutex held.
+int Persist(const Registry& registry, std::string* error) {
+  if (registry.file.empty()) {
+    return kOk;
+  }
+  nlohmann::ordered_json list = nlohmann::ordered_json::array();
+  for (const Started& s : registry.started) {
+    list.push_back(ToJson(s.info));
+  }
+  const std::string text =
+      list.dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace) + "\n";
+  const std::string tmp = registry.file + ".tmp";
+  const int fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+  bool ok = fd >= 0;
+  if (ok) {
+    ok = ::write(fd, text.data(), text.size()) == static_cast<ssize_t>(text.size());
+    ok = ::fsync(fd) == 0 && ok;
+    ok = ::close(fd) == 0 && ok;
+  }
+  if (!ok || std::rename(tmp.c_str(), registry.file.c_str()) != 0) {
+    *error = "cannot write " + registry.file + ": " + std::strerror(errno);
+    Q7_TRACE(kUnit, kTraceError, "%s", error->c_str());
+    std::remove(tmp.c_str());
+    return kIoError;
+  }
+  return kOk;
+}
+
+// Creates the request and agent object of a situation. Null agent when the table has no
+// manager able to serve it.
+Started Prepare(SituationInfo info, std::shared_ptr<const TableDefinition> table) {
+  Started s;
+  s.request = std::make_unique<Request>();
+  s.request->type = kSituationRequestType;
+  s.request->situation = info.name;
+  s.request->conditions = info.conditions;
+  s.agent = table->manager->CreateAgent(s.request.get());
+  s.table = std::move(table);
+  s.info = std::move(info);
+  return s;
+}
+
+}  // namespace
+
+int CheckSituation(std::string_view name, std::string_view table_name,
+                   const std::vector<ConditionText>& conditions, SituationInfo* out,
+                   std::string* error) {
+  if (!ValidName(name)) {
+    *error = "situation name \"" + std::string(name) + "\" must be 1 to " +
+             std::to_string(kMaxSituationNameLength) + " letters, digits, '_', '-' or '.'";
+    return kInvalidArgument;
+  }
+  const std::shared_ptr<const TableDefinition> table = FindTable(table_name);
+  if (table == nullptr) {
+    *error = "no table named \"" + std::string(table_name) + "\"";
+    return kNotFound;
+  }
+  SituationInfo info;
+  info.name = std::string(name);
+  info.table = table->name;
+  for (std::size_t i = 0; i < conditions.size(); ++i) {
+    const ConditionText& text = conditions[i];
+    const std::string where = "condition " + std::to_string(i + 1) + ": ";
+    const ColumnInfo* column = FindColumn(table->columns, text.column);
+    if (column == nullptr) {
+      *error = where + "table " + table->name + " has no column \"" + text.column + "\"";
+      return kInvalidArgument;
+    }
+    Condition condition;
+    condition.column = column->name;
+    if (!ParseConditionOp(text.op, &condition.op)) {
+      *error = where + "unknown operator \"" + text.op + "\" (EQ NE LT LE GT GE)";
+      return kInvalidArgument;
+    }
+    if (IsTextColumn(*column)) {
+      if (text.value.size() > static_cast<std::size_t>(column->width)) {
+        *error = where + "value for " + column->name + " is " + std::to_string(text.value.size()) +
+                 " bytes, the column holds " + std::to_string(column->width);
+        return kInvalidArgument;
+      }
+    } else {
+      std::int64_t value = 0;
+      if (!ParseInteger(text.value, &value)) {
+        *error = where + column->name + " is an integer column, \"" + text.value +
+                 "\" is not a whole number";
+        return kInvalidArgument;
+      }
+      if (!FitsColumn(value, column->width)) {
+        *error = where + "value " + text.value + " is out of range for " + column->name;
+        return kInvalidArgument;
+      }
+    }
+    condition.value = text.value;
+    info.conditions.push_back(std::move(condition));
+  }
+  *out = std::move(info);
+  return kOk;
+}
+
+int StartSituation(SituationInfo info, bool* replaced, std::string* error) {
+  const std::shared_ptr<const TableDefinition> table = FindTable(info.table);
+  if (table == nullptr) {
+    *error = "no table named \"" + info.table + "\"";
+    return kNotFound;
+  }
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::mutex> lock(registry.mutex);
+  Started fresh = Prepare(std::move(info), table);
+  if (fresh.agent == nullptr) {
+    *error = "table " + table->name + " cannot serve a situation";
+    return kInvalidArgument;
+  }
+  Q7_TRACE(kUnit, kTraceSummary, "starting situation %s on %s with %zu conditions",
+           fresh.info.name.c_str(), table->name.c_str(), fresh.info.conditions.size());
+  fresh.agent->TakeSampleConstructor();
+  *replaced = false;
+  for (Started& s : registry.started) {
+    if (s.info.name == fresh.info.name) {
+      s = std::move(fresh);
+      *replaced = true;
+      break;
+    }
+  }
+  if (!*replaced) {
+    registry.started.push_back(std::move(fresh));
+  }
+  return Persist(registry, error);
+}
+
+int StopSituation(std::string_view name, std::string* error) {
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::mutex> lock(registry.mutex);
+  for (auto it = registry.started.begin(); it != registry.started.end(); ++it) {
+    if (it->info.name == name) {
+      Q7_TRACE(kUnit, kTraceSummary, "stopping situation %s on %s", it->info.name.c_str(),
+               it->info.table.c_str());
+      it->agent->TakeSampleDestructor();
+      registry.started.erase(it);
+      return Persist(registry, error);
+    }
+  }
+  *error = "no situation named \"" + std::string(name) + "\" is started";
+  return kNotFound;
+}
+
+std::vector<SituationInfo> ListSituations() {
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::mutex> lock(registry.mutex);
+  std::vector<SituationInfo> out;
+  out.reserve(registry.started.size());
+  for (const Started& s : registry.started) {
+    out.push_back(s.info);
+  }
+  return out;
+}
+
+void SetSituationsFile(const std::string& path) {
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::mutex> lock(registry.mutex);
+  registry.file = path;
+}
+
+int RestoreSituations() {
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::mutex> lock(registry.mutex);
+  if (registry.file.empty()) {
+    return 0;
+  }
+  std::ifstream in(registry.file, std::ios::binary);
+  if (!in) {
+    Q7_TRACE(kUnit, kTraceDetail, "no situations to restore (%s)", registry.file.c_str());
+    return 0;
+  }
+  const std::string text((std::istreambuf_iterator<char>(in)), {});
+  const nlohmann::json list = nlohmann::json::parse(text, nullptr, false);
+  std::string problem;
+  if (list.is_discarded() || !list.is_array()) {
+    problem = "is not a JSON array";
+  }
+  std::vector<Started> restored;
+  for (std::size_t i = 0; problem.empty() && i < list.size(); ++i) {
+    const nlohmann::json& item = list[i];
+    if (!item.is_object() || !item.contains("name") || !item["name"].is_string() ||
+        !item.contains("table") || !item["table"].is_string() || !item.contains("conditions") ||
+        !item["conditions"].is_array()) {
+      problem = "entry " + std::to_string(i + 1) + " lacks name, table or conditions";
+      break;
+    }
+    std::vector<ConditionText> conditions;
+    for (const nlohmann::json& c : item["conditions"]) {
+      if (!c.is_object() || !c.value("column", nlohmann::json()).is_string() ||
+          !c.value("op", nlohmann::json()).is_string() ||
+          !c.value("value", nlohmann::json()).is_string()) {
+        problem = "entry " + std::to_string(i + 1) + " has a malformed condition";
+        break;
+      }
+      conditions.push_back({c["column"], c["op"], c["value"]});
+    }
+    if (!problem.empty()) {
+      break;
+    }
+    SituationInfo info;
+    std::string error;
+    if (CheckSituation(item["name"].get<std::string>(), item["table"].get<std::string>(),
+                       conditions, &info, &error) != kOk) {
+      Q7_TRACE(kUnit, kTraceError, "%s: not restoring situation %s: %s", registry.file.c_str(),
+               item["name"].get<std::string>().c_str(), error.c_str());
+      continue;
+    }
+    Started s = Prepare(std::move(info), FindTable(item["table"].get<std::string>()));
+    if (s.agent != nullptr) {
+      restored.push_back(std::move(s));
+    }
+  }
+  if (!problem.empty()) {
+    const std::string aside = registry.file + ".bad";
+    std::rename(registry.file.c_str(), aside.c_str());
+    TracePrintfAlways(kUnit, kTraceError, __func__,
+                      "%s %s; kept aside as %s, no situations restored", registry.file.c_str(),
+                      problem.c_str(), aside.c_str());
+    return 0;
+  }
+  for (Started& s : restored) {
+    Q7_TRACE(kUnit, kTraceSummary, "restored situation %s on %s", s.info.name.c_str(),
+             s.info.table.c_str());
+    registry.started.push_back(std::move(s));
+  }
+  return static_cast<int>(restored.size());
+}
+
+void ResetSituations() {
+  Registry& registry = TheRegistry();
+  std::lock_guard<std::mutex> lock(registry.mutex);
+  registry.started.clear();
+  registry.file.clear();
+}
+
+}  // namespace fw

@@ -1,0 +1,73 @@
+#pragma once
+
+// Situations: named, long-lived requests on a table. Starting one hands its conditions to the
+// table's agent object as a request of type 4 (TakeSampleConstructor); stopping it calls
+// TakeSampleDestructor. On the pattern tables this is how operators define patterns.
+//
+// The started situations are persisted, in the order they were started, in
+// <configdir>q7_situations.json (written to a temporary file, then renamed). At the next start
+// they are restored without being re-run: their effects (the patterns) come back through the
+// agent's own files. Stopping the agent never stops a situation.
+//
+// Thread safety: every function may be called from any thread; starts and stops are serialised,
+// so a table's agent objects see one situation change at a time.
+
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "framework/request.h"
+
+namespace fw {
+
+// A situation as started: its name, table (as the registry spells it) and conditions.
+struct SituationInfo {
+  std::string name;
+  std::string table;
+  std::vector<Condition> conditions;
+};
+
+// The longest situation name.
+inline constexpr std::size_t kMaxSituationNameLength = 64;
+
+// A condition as an operator writes it, before it is checked against the table.
+struct ConditionText {
+  std::string column;
+  std::string op;  // EQ NE LT LE GT GE, any case
+  std::string value;
+};
+
+// Checks name, table and conditions: the table must exist, every column must be one of its
+// columns, the operator one of EQ..GE, a text value no longer than its column, an integer value
+// a whole number within its column's range. Returns kOk with the checked situation in *out, or
+// kInvalidArgument (kNotFound for an unknown table) with *error naming the problem.
+int CheckSituation(std::string_view name, std::string_view table,
+                   const std::vector<ConditionText>& conditions, SituationInfo* out,
+                   std::string* error);
+
+// Starts a checked situation, replacing a started one of the same name (whose agent object is
+// then dropped without its destructor: the new start already replaced what the old one did).
+// Persists the list. Returns kOk, *replaced telling whether one was replaced; kIoError when the
+// list could not be written (the situation runs all the same; *error says so).
+int StartSituation(SituationInfo situation, bool* replaced, std::string* error);
+
+// Stops the situation of that name and persists the list. kNotFound when none is started.
+int StopSituation(std::string_view name, std::string* error);
+
+// The started situations, in the order they were started.
+std::vector<SituationInfo> ListSituations();
+
+// Where the list is persisted; empty: nowhere (the default until the main loop sets it).
+void SetSituationsFile(const std::string& path);
+
+// Reads the persisted list and keeps each situation as started, creating its agent object
+// without running it. Situations whose table is unknown are dropped with a trace. A file that
+// does not parse is traced, kept aside as "<file>.bad" and nothing is restored. Returns how
+// many situations were restored.
+int RestoreSituations();
+
+// Drops every situation without stopping it, and forgets the file (tests and shutdown).
+void ResetSituations();
+
+}  // namespace fw

@@ -1,0 +1,371 @@
+#include "q7tema/pattern_tables.h"
+
+#include <algorithm>
+#include <array>
+#include <cctype>
+#include <cstdint>
+#include <limits>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+
+#include "framework/trace.h"
+#include "q7tema/row_query.h"
+
+namespace q7tema {
+namespace {
+
+constexpr char kUnit[] = "tables";
+constexpr int kSampleRequestType = 3;
+constexpr int kSituationRequestType = 4;
+// Severity of the message sent when a situation defines no pattern.
+constexpr int kPatternErrorSeverity = 3;
+
+struct HookSlot {
+  std::mutex mutex;
+  PatternHooks hooks;  // guarded by mutex
+};
+
+HookSlot& Slot() {
+  static HookSlot slot;
+  return slot;
+}
+
+PatternHooks Hooks() {
+  std::lock_guard<std::mutex> lock(Slot().mutex);
+  return Slot().hooks;
+}
+
+bool SameColumn(std::string_view a, std::string_view b) {
+  if (a.size() != b.size()) {
+    return false;
+  }
+  for (std::size_t i = 0; i < a.size(); ++i) {
+    if (std::toupper(static_cast<unsigned char>(a[i])) !=
+        std::toupper(static_cast<unsigned char>(b[i]))) {
+      return false;
+    }
+  }
+  return true;
+}
+
+// The condition's value as the framework gives it, trailing padding dropped.
+std::string ValueText(const fw::Condition& condition) {
+  std::string value = condition.value_length < 0
+                          ? condition.value
+                          : condition.value.substr(
+                                0, static_cast<std::size_t>(std::max(0, condition.value_length)));
+  while (!value.empty() && value.back() == ' ') {
+    value.pop_back();
+  }
+  return value;
+}
+
+// Index of column among names, or -1.
+template <std::size_t N>
+int IndexOf(const std::array<const char*, N>& names, std::string_view column) {
+  for (std::size_t i = 0; i < N; ++i) {
+    if (SameColumn(names[i], column)) {
+      return static_cast<int>(i);
+    }
+  }
+  return -1;
+}
+
+// The settings one pattern needs, gathered condition by condition: text columns first, then
+// numbers. A pattern is complete when every one is set.
+template <std::size_t Texts, std::size_t Numbers>
+struct Settings {
+  std::array<std::optional<std::string>, Texts> texts;
+  std::array<std::optional<int32_t>, Numbers> numbers;
+
+  bool textsComplete() const {
+    for (const auto& t : texts) {
+      if (!t) {
+        return false;
+      }
+    }
+    return true;
+  }
+  bool complete() const {
+    for (const auto& n : numbers) {
+      if (!n) {
+        return false;
+      }
+    }
+    return textsComplete();
+  }
+};
+
+// Traces the request's situation name as every pattern-table call does; the name or null.
+const char* TraceSituation(const char* where, const fw::Request& request) {
+  if (!request.situation) {
+    Q7_TRACE(kUnit, fw::kTraceDetail, "%s SituationName() returned NULL, sampleType[%d]", where,
+             request.type);
+    return nullptr;
+  }
+  Q7_TRACE(kUnit, fw::kTraceDetail, "%s Situation name is [%s] sampleType[%d]", where,
+           request.situation->c_str(), request.type);
+  return request.situation->c_str();
+}
+
+void ReportNothingAdded(const char* situation, const char* const* missing, std::size_t count) {
+  fw::TracePrintfAlways(
+      kUnit, fw::kTraceError, __func__,
+      "Warning: pattern was not added because not all required columns were defined for "
+      "sitation %s",
+      situation);
+  for (std::size_t i = 0; i < count; ++i) {
+    if (missing[i] != nullptr) {
+      fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__, "%s", missing[i]);
+    }
+  }
+}
+
+void SendPatternError(const char* key, const char* situation) {
+  const PatternHooks hooks = Hooks();
+  if (hooks.sendMessage) {
+    hooks.sendMessage(key, kPatternErrorSeverity, situation);
+  }
+}
+
+// Sample rows of Row from its row query; only a sample request (type 3) yields any.
+template <typename Row>
+void AddPatternRows(TableBase<Row>& agent) {
+  if (agent.request()->type != kSampleRequestType) {
+    return;
+  }
+  const RowQuery<Row> query = RowQueryFor<Row>();
+  if (!query) {
+    return;
+  }
+  int count = 0;
+  const std::unique_ptr<Row[]> rows(query(agent.request()->type, &count));
+  if (rows != nullptr && count >= 1) {
+    agent.AddData(rows.get(), count);
+  }
+}
+
+}  // namespace
+
+void SetPatternHooks(PatternHooks hooks) {
+  std::lock_guard<std::mutex> lock(Slot().mutex);
+  Slot().hooks = std::move(hooks);
+}
+
+int32_t getFilterIntValue(const char* text, int length) {
+  if (text == nullptr) {
+    return 0;
+  }
+  const std::string_view all(text);
+  std::string_view value =
+      length < 0 ? all : all.substr(0, std::min(all.size(), static_cast<std::size_t>(length)));
+  while (!value.empty() && value.front() == ' ') {
+    value.remove_prefix(1);
+  }
+  bool negative = false;
+  if (!value.empty() && (value.front() == '+' || value.front() == '-')) {
+    negative = value.front() == '-';
+    value.remove_prefix(1);
+  }
+  int64_t result = 0;
+  for (const char c : value) {
+    if (c < '0' || c > '9') {
+      break;
+    }
+    // Saturate rather than wrap: a huge threshold stays huge.
+    result = std::min<int64_t>(result * 10 + (c - '0'),
+                               static_cast<int64_t>(std::numeric_limits<int32_t>::max()) + 1);
+  }
+  result = negative ? -result : result;
+  return static_cast<int32_t>(std::clamp<int64_t>(result, std::numeric_limits<int32_t>::min(),
+                                                  std::numeric_limits<int32_t>::max()));
+}
+
+bool registerTransactionPattern(const char* situation, const char* applicationName,
+                                const char* applicationPattern, const char* transactionName,
+                                const char* transactionPattern, int16_t aggapsuniq,
+                                int16_t aggtxsuniq, int16_t collinstcs, int32_t sampercent,
+                                int32_t mrtthres, int16_t importance) {
+  const PatternHooks hooks = Hooks();
+  return hooks.registerTransaction &&
+         hooks.registerTransaction(situation, applicationName, applicationPattern, transactionName,
+                                   transactionPattern, aggapsuniq, aggtxsuniq, collinstcs,
+                                   sampercent, mrtthres, importance);
+}
+
+bool deregisterTransactionPattern(const char* situation) {
+  const PatternHooks hooks = Hooks();
+  return hooks.deregisterTransaction && hooks.deregisterTransaction(situation);
+}
+
+bool registerClientPattern(const char* situation, const char* clientName,
+                           const char* hostNamePattern, const char* ipAddressPattern,
+                           int16_t agguniqly) {
+  const PatternHooks hooks = Hooks();
+  return hooks.registerClient &&
+         hooks.registerClient(situation, clientName, hostNamePattern, ipAddressPattern, agguniqly);
+}
+
+bool deregisterClientPattern(const char* situation) {
+  const PatternHooks hooks = Hooks();
+  return hooks.deregisterClient && hooks.deregisterClient(situation);
+}
+
+// ---- Q7TXPTNS ----
+
+namespace {
+
+constexpr std::array<const char*, 4> kTransactionTexts = {"APPLICATIN", "APPPATTERN", "TRANSACTN",
+                                                          "TRANSPATTN"};
+constexpr std::array<const char*, 6> kTransactionNumbers = {
+    "AGGAPSUNIQ", "AGGTXSUNIQ", "COLLINSTCS", "SAMPERCENT", "IMPORTANCE", "MRTTHRES"};
+// Settings an operator leaves out when giving only the four texts.
+constexpr std::array<int32_t, 6> kTransactionDefaults = {0, 1, 0, 100, 99, 10000000};
+constexpr std::array<const char*, 4> kTransactionMissing = {
+    "\t Application Name was not defined", "\t Application Pattern was not defined",
+    "\t Transaction Name was not defined", "\t Transaction Pattern was not defined"};
+
+using TransactionSettings = Settings<4, 6>;
+
+bool RegisterTransaction(const char* situation, const TransactionSettings& s) {
+  return registerTransactionPattern(
+      situation, s.texts[0]->c_str(), s.texts[1]->c_str(), s.texts[2]->c_str(), s.texts[3]->c_str(),
+      static_cast<int16_t>(*s.numbers[0]), static_cast<int16_t>(*s.numbers[1]),
+      static_cast<int16_t>(*s.numbers[2]), *s.numbers[3], *s.numbers[5],
+      static_cast<int16_t>(*s.numbers[4]));
+}
+
+}  // namespace
+
+void TableAgent<kq7_q7txptns_data_t>::TakeSampleConstructor() {
+  const fw::Request& r = *request();
+  const char* situation = TraceSituation("kq7_q7txptns_agent::TakeSampleConstructor", r);
+  if (r.type != kSituationRequestType || situation == nullptr) {
+    return;
+  }
+  // A situation started again replaces what it defined before.
+  deregisterTransactionPattern(situation);
+  TransactionSettings settings;
+  bool attempted = false;
+  bool added = false;
+  for (const fw::Condition& condition : r.conditions) {
+    if (const int t = IndexOf(kTransactionTexts, condition.column); t >= 0) {
+      settings.texts[static_cast<std::size_t>(t)] = ValueText(condition);
+    } else if (const int n = IndexOf(kTransactionNumbers, condition.column); n >= 0) {
+      settings.numbers[static_cast<std::size_t>(n)] =
+          getFilterIntValue(condition.value.c_str(), condition.value_length);
+    }
+    if (settings.complete()) {
+      attempted = true;
+      added = RegisterTransaction(situation, settings) || added;
+      settings = TransactionSettings();
+    }
+  }
+  if (!attempted && settings.textsComplete()) {
+    for (std::size_t i = 0; i < settings.numbers.size(); ++i) {
+      if (!settings.numbers[i]) {
+        settings.numbers[i] = kTransactionDefaults[i];
+      }
+    }
+    attempted = true;
+    added = RegisterTransaction(situation, settings);
+  }
+  if (!attempted) {
+    std::array<const char*, 4> missing{};
+    for (std::size_t i = 0; i < missing.size(); ++i) {
+      missing[i] = settings.texts[i] ? nullptr : kTransactionMissing[i];
+    }
+    ReportNothingAdded(situation, missing.data(), missing.size());
+  }
+  if (!added) {
+    SendPatternError("RT_AGENT_TRANSACTION_PATTERN_ERROR", situation);
+  }
+}
+
+void TableAgent<kq7_q7txptns_data_t>::TakeSample() {
+  TraceSituation("kq7_q7txptns_agent::TakeSample", *request());
+  AddPatternRows(*this);
+}
+
+void TableAgent<kq7_q7txptns_data_t>::TakeSampleDestructor() {
+  const char* situation = TraceSituation("kq7_q7txptns_agent::TakeSampleDestructor", *request());
+  if (situation != nullptr) {
+    deregisterTransactionPattern(situation);
+  }
+}
+
+// ---- Q7CLNTPTNS ----
+
+namespace {
+
+constexpr std::array<const char*, 3> kClientTexts = {"CLIENTNA", "CLIENTHOPT", "CLIENTPPT"};
+constexpr std::array<const char*, 1> kClientNumbers = {"AGGUNIQLY"};
+constexpr std::array<const char*, 3> kClientMissing = {
+    "\t Client Name was not defined", "\t Client Host Name Pattern was not defined",
+    "\t Client IP Pattern was not defined"};
+
+using ClientSettings = Settings<3, 1>;
+
+bool RegisterClient(const char* situation, const ClientSettings& s) {
+  return registerClientPattern(situation, s.texts[0]->c_str(), s.texts[1]->c_str(),
+                               s.texts[2]->c_str(), static_cast<int16_t>(*s.numbers[0]));
+}
+
+}  // namespace
+
+void TableAgent<kq7_q7clntptns_data_t>::TakeSampleConstructor() {
+  const fw::Request& r = *request();
+  const char* situation = TraceSituation("kq7_q7clntptns_agent::TakeSampleConstructor", r);
+  if (r.type != kSituationRequestType || situation == nullptr) {
+    return;
+  }
+  deregisterClientPattern(situation);
+  ClientSettings settings;
+  bool attempted = false;
+  bool added = false;
+  for (const fw::Condition& condition : r.conditions) {
+    if (const int t = IndexOf(kClientTexts, condition.column); t >= 0) {
+      settings.texts[static_cast<std::size_t>(t)] = ValueText(condition);
+    } else if (IndexOf(kClientNumbers, condition.column) >= 0) {
+      settings.numbers[0] = getFilterIntValue(condition.value.c_str(), condition.value_length);
+    }
+    if (settings.complete()) {
+      attempted = true;
+      added = RegisterClient(situation, settings) || added;
+      settings = ClientSettings();
+    }
+  }
+  if (!attempted && settings.textsComplete()) {
+    settings.numbers[0] = settings.numbers[0].value_or(0);
+    attempted = true;
+    added = RegisterClient(situation, settings);
+  }
+  if (!attempted) {
+    std::array<const char*, 3> missing{};
+    for (std::size_t i = 0; i < missing.size(); ++i) {
+      missing[i] = settings.texts[i] ? nullptr : kClientMissing[i];
+    }
+    ReportNothingAdded(situation, missing.data(), missing.size());
+  }
+  if (!added) {
+    SendPatternError("RT_AGENT_CLIENT_PATTERN_ERROR", situation);
+  }
+}
+
+void TableAgent<kq7_q7clntptns_data_t>::TakeSample() {
+  TraceSituation("kq7_q7clntptns_agent::TakeSample", *request());
+  AddPatternRows(*this);
+}
+
+void TableAgent<kq7_q7clntptns_data_t>::TakeSampleDestructor() {
+  const char* situation = TraceSituation("kq7_q7clntptns_agent::TakeSampleDestructor", *request());
+  if (situation != nullptr) {
+    deregisterClientPattern(situation);
+  }
+}
+
+}  // namespace q7tema
