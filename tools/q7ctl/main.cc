@@ -1,0 +1,327 @@
+// q7ctl: the operator's command line for a running q7agent. Each command is one or two calls of
+// the agent's HTTP API; the reply is printed as a table, CSV or JSON.
+
+#include <CLI/CLI.hpp>
+#include <iostream>
+#include <string>
+#include <vector>
+
+#include "tools/q7ctl/client.h"
+#include "tools/q7ctl/config.h"
+#include "tools/q7ctl/format.h"
+
+namespace q7ctl {
+namespace {
+
+// Exit codes: 1 when the agent cannot be reached or refuses, 2 for a bad command line.
+constexpr int kFailed = 1;
+constexpr int kUsage = 2;
+
+constexpr char kMainFooter[] =
+    R"(Connection (unless --url and --token are given), as the agent itself looks it up:
+  address  Q7_HTTP_ADDRESS from the environment, else from <configdir>q7.env, else the address
+           the agent wrote to <home>logs/q7agent.addr, else 127.0.0.1:7420
+  token    <configdir>q7_api_token, sent as "Authorization: Bearer <token>"
+  home = $Q7_HOME or the parent of q7ctl's bin/; configdir = $Q7_CONFIG_DIR or <home>config/
+Examples:
+  q7ctl tables
+  q7ctl sample Q7TXSM --where "APPLICATIN EQ Shop" -o csv
+  q7ctl situation start Shop --table Q7TXPTNS APPLICATIN=Shop APPPATTERN='*' \
+        TRANSACTN=Checkout TRANSPATTN='*/checkout*'
+  q7ctl events --follow
+Exit status: 0 done, 1 the agent failed or could not be reached, 2 bad command line.
+)";
+
+struct Globals {
+  std::string url;
+  std::string token;
+  std::string output = "table";
+  bool wide = false;
+};
+
+int Fail(const Result& result) {
+  std::cerr << "q7ctl: " << result.message() << '\n';
+  return kFailed;
+}
+
+// The array reply[key], or a failure when the agent's reply does not have one.
+Result ArrayField(const Json& reply, const char* key, Json* out) {
+  if (!reply.is_object() || !reply.contains(key) || !(*out = reply[key]).is_array()) {
+    return Result::Error(std::string("unexpected reply from the agent: no \"") + key + "\" array");
+  }
+  return Result::Ok();
+}
+
+// A condition as `situation start` takes it: COLUMN=VALUE for EQ, else "COLUMN OP VALUE".
+std::string ConditionText(const Json& condition) {
+  const std::string column = CellText(condition.value("column", Json()));
+  const std::string op = CellText(condition.value("op", Json("EQ")));
+  const std::string value = CellText(condition.value("value", Json()));
+  return op == "EQ" ? column + "=" + value : column + " " + op + " " + value;
+}
+
+void SayNone(const FormatOptions& options, const char* what) {
+  if (options.format == OutputFormat::kTable) {
+    std::cerr << "(no " << what << ")\n";
+  }
+}
+
+int Tables(ApiClient& client, const FormatOptions& options) {
+  Json reply, tables;
+  Result result = client.Get("/api/v1/tables", &reply);
+  if (result.ok()) {
+    result = ArrayField(reply, "tables", &tables);
+  }
+  if (!result.ok()) {
+    return Fail(result);
+  }
+  Json rows = Json::array();
+  for (const Json& table : tables) {
+    if (!table.is_object()) {
+      continue;
+    }
+    Json row = Json::object();
+    row["name"] = table.value("name", Json());
+    row["columns"] = table.contains("columns") ? table["columns"].size() : 0;
+    rows.push_back(std::move(row));
+  }
+  WriteRows(rows, options, std::cout, tables);
+  return 0;
+}
+
+int Sample(ApiClient& client, const FormatOptions& options, const std::string& table,
+           const std::vector<std::string>& wheres, std::optional<long> limit) {
+  Json reply, rows;
+  Result result = client.Get(SampleTarget(table, wheres, limit), &reply);
+  if (result.ok()) {
+    result = ArrayField(reply, "rows", &rows);
+  }
+  if (!result.ok()) {
+    return Fail(result);
+  }
+  if (rows.empty()) {
+    SayNone(options, "rows");
+  }
+  WriteRows(rows, options, std::cout);
+  return 0;
+}
+
+int SituationList(ApiClient& client, const FormatOptions& options) {
+  Json reply, situations;
+  Result result = client.Get("/api/v1/situations", &reply);
+  if (result.ok()) {
+    result = ArrayField(reply, "situations", &situations);
+  }
+  if (!result.ok()) {
+    return Fail(result);
+  }
+  Json rows = Json::array();
+  for (const Json& situation : situations) {
+    if (!situation.is_object()) {
+      continue;
+    }
+    std::string conditions;
+    for (const Json& condition : situation.value("conditions", Json::array())) {
+      if (!condition.is_object()) {
+        continue;
+      }
+      conditions += (conditions.empty() ? "" : " ") + ConditionText(condition);
+    }
+    Json row = Json::object();
+    row["name"] = situation.value("name", Json());
+    row["table"] = situation.value("table", Json());
+    row["conditions"] = conditions;
+    rows.push_back(std::move(row));
+  }
+  if (rows.empty()) {
+    SayNone(options, "situations started");
+  }
+  WriteRows(rows, options, std::cout, situations);
+  return 0;
+}
+
+int SituationStart(ApiClient& client, const std::string& name, const std::string& table,
+                   const std::vector<std::string>& words) {
+  Json conditions = Json::array();
+  for (const std::string& word : words) {
+    Json condition;
+    std::string error;
+    if (!ParseCondition(word, &condition, &error)) {
+      std::cerr << "q7ctl: " << error << '\n';  // the command line checked it already
+      return kUsage;
+    }
+    conditions.push_back(std::move(condition));
+  }
+  Json reply;
+  const Result result = client.Put(SituationTarget(name), SituationBody(table, conditions), &reply);
+  if (!result.ok()) {
+    return Fail(result);
+  }
+  std::cout << "situation " << name << " started on " << table << " with " << conditions.size()
+            << (conditions.size() == 1 ? " condition" : " conditions") << '\n';
+  return 0;
+}
+
+int SituationStop(ApiClient& client, const std::string& name) {
+  Json reply;
+  const Result result = client.Delete(SituationTarget(name), &reply);
+  if (!result.ok()) {
+    return Fail(result);
+  }
+  std::cout << "situation " << name << " stopped\n";
+  return 0;
+}
+
+int Events(ApiClient& client, const FormatOptions& options, bool follow) {
+  Json reply, events;
+  Result result = client.Get("/api/v1/events", &reply);
+  if (result.ok()) {
+    result = ArrayField(reply, "events", &events);
+  }
+  if (!result.ok()) {
+    return Fail(result);
+  }
+  if (!follow) {
+    if (events.empty()) {
+      SayNone(options, "events");
+    }
+    WriteRows(events, options, std::cout);
+    return 0;
+  }
+  StreamWriter writer(options, std::cout);
+  writer.Begin(events);
+  // Runs until the agent ends the stream or the operator interrupts q7ctl.
+  return Fail(client.Stream("/api/v1/events/stream", [&writer](const Json& event) {
+    writer.Write(event);
+    return true;
+  }));
+}
+
+// Footer of a command's help: its examples, then the options every command takes.
+std::string Help(const std::string& examples) {
+  return examples +
+         "\nOptions of every command (before or after it): --url URL, --token TOKEN,\n"
+         "  -o table|json|csv, --wide; q7ctl --help tells how the agent is found.\n";
+}
+
+CLI::Validator ConditionValidator() {
+  return CLI::Validator(
+      [](std::string& word) {
+        Json condition;
+        std::string error;
+        return ParseCondition(word, &condition, &error) ? std::string() : error;
+      },
+      "COLUMN=VALUE");
+}
+
+int Run(int argc, char** argv) {
+  CLI::App app{"q7ctl: operator command line for a running q7agent (its HTTP API)", "q7ctl"};
+  app.set_version_flag("--version", std::string("q7ctl ") + Q7_VERSION_TEXT);
+  app.require_subcommand(1);
+  app.fallthrough();  // subcommands inherit it: the options below may follow the command
+  app.footer(kMainFooter);
+  Globals globals;
+  app.add_option("--url", globals.url, "Agent address, http://host:port (default: looked up)");
+  app.add_option("--token", globals.token, "API token (default: <configdir>q7_api_token)");
+  app.add_option("-o,--output", globals.output, "Output format: table, json or csv")
+      ->check(CLI::IsMember({"table", "json", "csv"}))
+      ->capture_default_str();
+  app.add_flag("--wide", globals.wide, "Table output: do not cut long text columns");
+
+  CLI::App* tables = app.add_subcommand("tables", "List the agent's tables in load order");
+  tables->footer(Help("Example:\n  q7ctl tables\n  q7ctl tables -o json   # with every column"));
+
+  CLI::App* sample = app.add_subcommand("sample", "Take one sample of a table");
+  std::string table;
+  std::vector<std::string> wheres;
+  long limit = 0;
+  sample->add_option("TABLE", table, "Table name, e.g. Q7TXSM")->required();
+  sample
+      ->add_option("--where", wheres,
+                   "Filter \"COLUMN OP VALUE\", OP one of EQ NE LT LE GT GE (repeatable; all "
+                   "must hold)")
+      ->expected(1)
+      ->multi_option_policy(CLI::MultiOptionPolicy::TakeAll);
+  CLI::Option* limit_option =
+      sample->add_option("--limit", limit, "At most N rows")->check(CLI::NonNegativeNumber);
+  sample->footer(Help(
+      "Examples:\n"
+      "  q7ctl sample Q7AGNTDTS\n"
+      "  q7ctl sample Q7TXSM --where \"APPLICATIN EQ Shop\" --where \"TOTREQ GT 10\" --limit 5\n"
+      "  q7ctl sample Q7TXSM -o csv > q7txsm.csv"));
+
+  CLI::App* situation = app.add_subcommand("situation", "List, start or stop situations");
+  situation->require_subcommand(1);
+  CLI::App* list = situation->add_subcommand("list", "List the started situations");
+  list->footer(Help("Example:\n  q7ctl situation list"));
+  CLI::App* start = situation->add_subcommand("start", "Start a situation on a pattern table");
+  std::string name, situation_table;
+  std::vector<std::string> words;
+  start->add_option("NAME", name, "Situation name")->required();
+  start->add_option("--table", situation_table, "Table the situation runs on, e.g. Q7TXPTNS")
+      ->required();
+  start
+      ->add_option("CONDITIONS", words,
+                   "COLUMN=VALUE words, each one EQ condition, in order (a column may repeat: "
+                   "a pattern table reads complete sets of conditions)")
+      ->required()
+      ->check(ConditionValidator());
+  start->footer(
+      Help("Example:\n"
+           "  q7ctl situation start Shop --table Q7TXPTNS APPLICATIN=Shop APPPATTERN='*' \\\n"
+           "        TRANSACTN=Checkout TRANSPATTN='*/checkout*'\n"
+           "The value is everything after the first '=', so it may hold '=' itself."));
+  CLI::App* stop = situation->add_subcommand("stop", "Stop a situation");
+  stop->add_option("NAME", name, "Situation name")->required();
+  stop->footer(Help("Example:\n  q7ctl situation stop Shop"));
+
+  CLI::App* events = app.add_subcommand("events", "Show the agent's recent data events");
+  bool follow = false;
+  events->add_flag("-f,--follow", follow,
+                   "Then print each new event as it arrives, until interrupted (JSON output: "
+                   "one object per line)");
+  events->footer(Help("Examples:\n  q7ctl events\n  q7ctl events --follow -o csv"));
+
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& e) {
+    const int code = app.exit(e);
+    return code == 0 ? 0 : kUsage;  // --help and --version are successes too
+  }
+
+  FormatOptions options;
+  ParseOutputFormat(globals.output, &options.format);
+  options.wide = globals.wide;
+  Connection connection;
+  std::string error;
+  if (!ResolveConnection(Environment::Process(), globals.url, globals.token, &connection, &error)) {
+    std::cerr << "q7ctl: " << error << '\n';
+    return kFailed;
+  }
+  ApiClient client(connection.url, connection.token);
+
+  if (tables->parsed()) {
+    return Tables(client, options);
+  }
+  if (sample->parsed()) {
+    return Sample(client, options, table, wheres,
+                  limit_option->count() > 0 ? std::optional<long>(limit) : std::nullopt);
+  }
+  if (list->parsed()) {
+    return SituationList(client, options);
+  }
+  if (start->parsed()) {
+    return SituationStart(client, name, situation_table, words);
+  }
+  if (stop->parsed()) {
+    return SituationStop(client, name);
+  }
+  return Events(client, options, follow);
+}
+
+}  // namespace
+}  // namespace q7ctl
+
+int main(int argc, char** argv) {
+  return q7ctl::Run(argc, argv);
+}
