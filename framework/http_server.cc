@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "framework/agent_runtime.h"
+#include "framework/events_api.h"
 #include "framework/runtime_state.h"
 #include "framework/sample_query.h"
 #include "framework/status.h"
@@ -218,6 +219,7 @@ void HttpServer::InstallRoutes() {
   s.Get("/api/v1/tables",
         [](const httplib::Request&, httplib::Response& res) { ReplyJson(res, 200, Tables()); });
   s.Get(R"(/api/v1/tables/([A-Za-z0-9_]+))", ServeSample);
+  InstallEventRoutes(s);
 }
 
 int HttpServer::Start(const std::string& address, std::string* error) {
@@ -261,6 +263,7 @@ void HttpServer::Stop() {
   if (!thread_.joinable()) {
     return;
   }
+  EndEventStreams(*server_);  // stop() waits for the worker threads that streams hold
   server_->stop();
   thread_.join();
 }
