@@ -141,9 +141,17 @@ class EventsEndpointTest : public EventsTest {
     return client;
   }
 
+  // What a stream client saw: the status, everything received, and whether the stream ended
+  // with its closing chunk rather than a broken connection.
+  struct StreamResult {
+    int status = -1;
+    std::string body;
+    bool clean_end = false;
+  };
+
   // Opens a stream on a thread of its own. *opened is set once the answer's status is known
-  // (the subscription exists by then); the future holds the status and everything received.
-  std::future<std::pair<int, std::string>> OpenStream(std::promise<int>* opened) {
+  // (the subscription exists by then).
+  std::future<StreamResult> OpenStream(std::promise<int>* opened) {
     return std::async(std::launch::async, [this, opened] {
       auto client = Client();
       std::string body;
@@ -163,7 +171,7 @@ class EventsEndpointTest : public EventsTest {
         status = res ? res->status : -1;
         opened->set_value(status);
       }
-      return std::make_pair(status, body);
+      return StreamResult{status, body, static_cast<bool>(res)};
     });
   }
 
@@ -188,7 +196,7 @@ TEST_F(EventsEndpointTest, ListsRowsAsJsonWithLimit) {
   EXPECT_EQ(400, res->status);
 }
 
-// A stream delivers a row pushed after it opened, and ends when the server stops.
+// A stream delivers a row pushed after it opened, and ends cleanly when the server stops.
 TEST_F(EventsEndpointTest, StreamDeliversRowsAndEndsOnStop) {
   std::promise<int> opened;
   auto stream = OpenStream(&opened);
@@ -201,15 +209,16 @@ TEST_F(EventsEndpointTest, StreamDeliversRowsAndEndsOnStop) {
   server_.Stop();
   EXPECT_LT(std::chrono::steady_clock::now() - stopping, 2s);
   ASSERT_EQ(std::future_status::ready, stream.wait_for(2s));
-  const auto [status, body] = stream.get();
-  EXPECT_EQ(200, status);
-  EXPECT_EQ("data: {\"text\":\"n\",\"number\":42}\n\n", body);
+  const StreamResult result = stream.get();
+  EXPECT_EQ(200, result.status);
+  EXPECT_EQ("data: {\"text\":\"n\",\"number\":42}\n\n", result.body);
+  EXPECT_TRUE(result.clean_end);
 }
 
 // Streams hold worker threads, so only a few may be open; the next one is refused.
 TEST_F(EventsEndpointTest, CapsOpenStreams) {
   std::vector<std::promise<int>> opened(kMaxEventStreams + 1);
-  std::vector<std::future<std::pair<int, std::string>>> streams;
+  std::vector<std::future<StreamResult>> streams;
   for (int i = 0; i < kMaxEventStreams; ++i) {
     streams.push_back(OpenStream(&opened[i]));
     ASSERT_EQ(200, opened[i].get_future().get());
