@@ -15,6 +15,7 @@
 #include "framework/agent_runtime.h"
 #include "framework/api_token.h"
 #include "framework/http_json.h"
+#include "framework/events_api.h"
 #include "framework/runtime_state.h"
 #include "framework/sample_query.h"
 #include "framework/situations_api.h"
@@ -224,6 +225,7 @@ void HttpServer::InstallRoutes(bool loopback) {
         [](const httplib::Request&, httplib::Response& res) { ReplyJson(res, 200, Tables()); });
   s.Get(R"(/api/v1/tables/([A-Za-z0-9_]+))", ServeSample);
   InstallSituationRoutes(s);
+  InstallEventRoutes(s);
 }
 
 int HttpServer::Start(const std::string& address, std::string* error) {
@@ -267,6 +269,7 @@ void HttpServer::Stop() {
   if (!thread_.joinable()) {
     return;
   }
+  EndEventStreams(*server_);  // stop() waits for the worker threads that streams hold
   server_->stop();
   thread_.join();
 }

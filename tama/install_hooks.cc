@@ -4,6 +4,7 @@
 #include "core/analyzer/dpx_file_manager.h"
 #include "q7tema/pattern_tables.h"
 #include "q7tema/row_query.h"
+#include "tama/agent_config.h"
 #include "tama/agent_details.h"
 #include "tama/agent_hooks.h"
 #include "tama/agent_message.h"
@@ -29,6 +30,7 @@ void installRowQueries() {
   Q7_ANALYZER_ROW_TABLES(Q7_ROW_QUERY)
 #undef Q7_ROW_QUERY
   q7tema::SetRowQuery<kq7_q7agntdts_data_t>(&getAgentDetailRows);
+  q7tema::SetRowQuery<kq7_q7agntmsgs_data_t>(&getAgentMessageRows);
   q7tema::SetRowQuery<kq7_q7txptns_data_t>([](int sampleType, int* count) {
     return CDPXAnalyzer::GetInstanceNoStart()->getTransactionPatterns(sampleType, count);
   });
@@ -78,6 +80,8 @@ void installAgentHooks() {
                                 const std::vector<std::string>& args) {
     AgentMessage::sendMessage(key, severity, args);
   };
+  // Messages are looked up in the bundle that configuration finds beside the agent.
+  setResourceBundleHook(&AgentMessage::setResourceBundle);
   installRowQueries();
   installPatternHooks();
   // The file manager tails the collector's data directory for the analyzer.

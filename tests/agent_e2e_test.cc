@@ -8,6 +8,7 @@
 
 #include <chrono>
 #include <filesystem>
+#include <future>
 #include <nlohmann/json.hpp>
 #include <string>
 #include <thread>
@@ -144,6 +145,47 @@ TEST_F(AgentE2ETest, SamplesATable) {
   get(address, "/api/v1/tables/Q7TXSM?where=TOTREQ%20GT%205", &status);
   EXPECT_EQ(200, status);
   stopWith(SIGTERM);
+}
+
+// Start-up announces itself as an agent message: it shows among the events and in samples of
+// the agent-messages table. An open event stream does not hold up a SIGTERM.
+TEST_F(AgentE2ETest, StartMessageIsAnEventAndStreamsEndOnSigterm) {
+  const std::string address = start();
+  const auto isStartMessage = [](const nlohmann::json& row) {
+    return row.value("msgid", "") == "KQ7RT0001I" && row.value("severity", 0) == 4 &&
+           row.value("component", "") == "WebAgent" &&
+           row.value("msgtext", "") == "The Response Time agent has started.";
+  };
+  int status = 0;
+  const nlohmann::json events = get(address, "/api/v1/events", &status);
+  EXPECT_EQ(200, status);
+  ASSERT_EQ(1u, events["events"].size()) << events.dump();
+  EXPECT_TRUE(isStartMessage(events["events"][0])) << events.dump();
+  const nlohmann::json sample = get(address, "/api/v1/tables/Q7AGNTMSGS", &status);
+  EXPECT_EQ(200, status);
+  ASSERT_EQ(1u, sample["rows"].size()) << sample.dump();
+  EXPECT_TRUE(isStartMessage(sample["rows"][0])) << sample.dump();
+
+  std::promise<int> opened;
+  auto stream = std::async(std::launch::async, [&] {
+    httplib::Client client("http://" + address);
+    client.set_read_timeout(10, 0);
+    bool answered = false;
+    client.Get(
+        "/api/v1/events/stream",
+        [&](const httplib::Response& res) {
+          answered = true;
+          opened.set_value(res.status);
+          return true;
+        },
+        [](const char*, std::size_t) { return true; });
+    if (!answered) {
+      opened.set_value(-1);
+    }
+  });
+  ASSERT_EQ(200, opened.get_future().get());
+  stopWith(SIGTERM);
+  EXPECT_EQ(std::future_status::ready, stream.wait_for(2s));
 }
 
 // SIGINT stops the agent just as SIGTERM does.

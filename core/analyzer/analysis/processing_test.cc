@@ -20,6 +20,7 @@
 #include "core/history/history_store.h"
 #include "framework/clock.h"
 #include "framework/trace_capture.h"
+#include "tama/agent_message.h"
 #include "tama/cconfig.h"
 #include "tests/support/scratch_dir.h"
 
@@ -48,13 +49,24 @@ TEST_F(ProcessingTest, SamplingTakesEverySecondMatch) {
 
 // The longer pattern wins an overlap, the earlier one a tie, and the overlap is reported.
 TEST_F(ProcessingTest, LongerPatternWinsAnOverlap) {
-  fw::TraceCapture capture("*=ERROR");
+  AgentMessage::resetForTesting();
+  AgentMessage::setResourceBundle(Q7_MESSAGE_BUNDLE_DIR);
+  auto lastMessage = [] {
+    const std::vector<AgentMessage> messages = AgentMessage::recentMessages();
+    return messages.empty() ? std::string() : std::string(messages.back().text);
+  };
   AddPattern("site", "Site", "*", "Any", "*");
   AddPattern("checkout", "Shop", "*", "Checkout", "*/checkout*");
-  EXPECT_TRUE(capture.contains("TRANSPATTERN_OVERLAP_WARNING"));
-  EXPECT_TRUE(capture.contains("[checkout] [site] [checkout]"));
+  EXPECT_NE(std::string::npos,
+            lastMessage().find("situation[checkout] overlaps with situation[site] and "
+                               "transactions that match both will goto situation[checkout]"))
+      << lastMessage();
   AddPattern("checkout2", "Other", "*", "Checkout2", "*/c*eckout*");  // same length: later
-  EXPECT_TRUE(capture.contains("[checkout2] [checkout] [checkout]"));
+  EXPECT_NE(std::string::npos,
+            lastMessage().find("situation[checkout2] overlaps with situation[checkout] and "
+                               "transactions that match both will goto situation[checkout]"))
+      << lastMessage();
+  AgentMessage::resetForTesting();
   Process(Page("shop.example", "/shop/checkout?step=1"));
   Process(Page("shop.example", "/shop/index"));
   auto rows = Rows();

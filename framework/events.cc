@@ -1,0 +1,150 @@
+#include "framework/events.h"
+
+#include <algorithm>
+#include <cctype>
+#include <map>
+#include <utility>
+
+#include "framework/status.h"
+
+namespace fw {
+namespace {
+
+std::string Key(std::string_view table) {
+  std::string key(table);
+  for (char& c : key) {
+    c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+  }
+  return key;
+}
+
+struct EventHub {
+  // mutex guards everything below. Rows are delivered to subscriptions while it is held, so
+  // every subscriber sees rows in sequence order.
+  std::mutex mutex;
+  std::map<std::string, std::deque<EventRow>> rings;  // by upper-case table name
+  std::vector<std::weak_ptr<EventSubscription>> subscriptions;
+  std::uint64_t last_sequence = 0;
+};
+
+// A function-local static, so rows may be pushed during start-up before anything else runs.
+EventHub& Hub() {
+  static EventHub hub;
+  return hub;
+}
+
+}  // namespace
+
+int PushEventRows(std::string_view table, const void* rows, std::size_t row_size, int count) {
+  if (table.empty() || rows == nullptr || row_size == 0 || count < 1) {
+    return kInvalidArgument;
+  }
+  EventHub& hub = Hub();
+  std::lock_guard<std::mutex> lock(hub.mutex);
+  std::deque<EventRow>& ring = hub.rings[Key(table)];
+  // Drop subscriptions whose owners are gone before delivering to the rest.
+  std::vector<std::shared_ptr<EventSubscription>> live;
+  std::erase_if(hub.subscriptions, [&](const std::weak_ptr<EventSubscription>& weak) {
+    std::shared_ptr<EventSubscription> subscription = weak.lock();
+    if (subscription == nullptr) {
+      return true;
+    }
+    live.push_back(std::move(subscription));
+    return false;
+  });
+  const auto* bytes = static_cast<const std::byte*>(rows);
+  for (int i = 0; i < count; ++i) {
+    EventRow row;
+    row.table = std::string(table);
+    row.sequence = ++hub.last_sequence;
+    const std::byte* start = bytes + static_cast<std::size_t>(i) * row_size;
+    row.bytes.assign(start, start + row_size);
+    for (const auto& subscription : live) {
+      subscription->Deliver(row);
+    }
+    ring.push_back(std::move(row));
+    if (ring.size() > kEventRingCapacity) {
+      ring.pop_front();
+    }
+  }
+  return kOk;
+}
+
+std::vector<EventRow> ListEventRows(std::string_view table) {
+  EventHub& hub = Hub();
+  std::lock_guard<std::mutex> lock(hub.mutex);
+  const auto it = hub.rings.find(Key(table));
+  if (it == hub.rings.end()) {
+    return {};
+  }
+  return {it->second.begin(), it->second.end()};
+}
+
+std::vector<EventRow> ListAllEventRows() {
+  std::vector<EventRow> all;
+  {
+    EventHub& hub = Hub();
+    std::lock_guard<std::mutex> lock(hub.mutex);
+    for (const auto& [name, ring] : hub.rings) {
+      all.insert(all.end(), ring.begin(), ring.end());
+    }
+  }
+  std::sort(all.begin(), all.end(),
+            [](const EventRow& a, const EventRow& b) { return a.sequence < b.sequence; });
+  return all;
+}
+
+std::shared_ptr<EventSubscription> SubscribeEvents() {
+  std::shared_ptr<EventSubscription> subscription(new EventSubscription());
+  EventHub& hub = Hub();
+  std::lock_guard<std::mutex> lock(hub.mutex);
+  hub.subscriptions.push_back(subscription);
+  return subscription;
+}
+
+void ResetEventsForTesting() {
+  EventHub& hub = Hub();
+  std::lock_guard<std::mutex> lock(hub.mutex);
+  hub.rings.clear();
+}
+
+void EventSubscription::Deliver(const EventRow& row) {
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    if (closed_) {
+      return;
+    }
+    waiting_.push_back(row);
+    if (waiting_.size() > kEventRingCapacity) {
+      waiting_.pop_front();
+    }
+  }
+  ready_.notify_all();
+}
+
+bool EventSubscription::Next(EventRow* row, std::chrono::milliseconds timeout) {
+  std::unique_lock<std::mutex> lock(mutex_);
+  ready_.wait_for(lock, timeout, [this] { return closed_ || !waiting_.empty(); });
+  if (closed_ || waiting_.empty()) {
+    return false;
+  }
+  *row = std::move(waiting_.front());
+  waiting_.pop_front();
+  return true;
+}
+
+void EventSubscription::Close() {
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    closed_ = true;
+    waiting_.clear();
+  }
+  ready_.notify_all();
+}
+
+bool EventSubscription::closed() const {
+  std::lock_guard<std::mutex> lock(mutex_);
+  return closed_;
+}
+
+}  // namespace fw

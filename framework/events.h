@@ -1,0 +1,83 @@
+#pragma once
+
+// Data events of event tables (agent messages): for every event table, a ring of its last 1000
+// rows, and subscriptions that receive each row pushed after they were taken (for streaming).
+//
+// The rings are keyed by table name (matched in any case) and exist from process start: rows
+// may be pushed before the table is registered, since "RT_AGENT_STARTED" is sent before the
+// agent loader runs. Rows are kept as raw bytes of the table's row layout; readers describe
+// them with the table's registered columns.
+//
+// Thread safety: every function and every EventSubscription member may be called from any
+// thread.
+
+#include <chrono>
+#include <condition_variable>
+#include <cstddef>
+#include <cstdint>
+#include <deque>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace fw {
+
+// Rows kept per event table, and rows a subscription buffers before it drops the oldest.
+inline constexpr std::size_t kEventRingCapacity = 1000;
+
+// One pushed row.
+struct EventRow {
+  std::string table;             // the table's name as pushed ("Q7AGNTMSGS")
+  std::uint64_t sequence = 0;    // order of pushes over all tables, from 1
+  std::vector<std::byte> bytes;  // one row of the table's layout
+};
+
+// Copies count rows of row_size bytes at rows into the ring of table, evicting the oldest rows
+// beyond kEventRingCapacity, and hands each to every open subscription. Returns kOk, or
+// kInvalidArgument (and keeps nothing) for an empty table name, null rows, a zero row size or
+// a count below 1.
+int PushEventRows(std::string_view table, const void* rows, std::size_t row_size, int count);
+
+// The rows kept for table, oldest first; empty for a table that never had an event.
+std::vector<EventRow> ListEventRows(std::string_view table);
+
+// The rows kept for every table, oldest first (by sequence).
+std::vector<EventRow> ListAllEventRows();
+
+// Receives the rows pushed after it was created, until closed or destroyed (the pushers hold
+// it only weakly). Rows wait in the subscription until taken; when kEventRingCapacity are
+// waiting, the oldest is dropped.
+class EventSubscription {
+ public:
+  EventSubscription(const EventSubscription&) = delete;
+  EventSubscription& operator=(const EventSubscription&) = delete;
+
+  // Waits up to timeout for a row. Returns true and fills *row with the oldest waiting row;
+  // false after the timeout, or at once when the subscription is closed.
+  bool Next(EventRow* row, std::chrono::milliseconds timeout);
+
+  // Ends the subscription: Next returns false from now on, waking a waiting caller.
+  void Close();
+  bool closed() const;
+
+ private:
+  friend std::shared_ptr<EventSubscription> SubscribeEvents();
+  friend int PushEventRows(std::string_view, const void*, std::size_t, int);
+  EventSubscription() = default;
+  void Deliver(const EventRow& row);
+
+  mutable std::mutex mutex_;
+  std::condition_variable ready_;
+  std::deque<EventRow> waiting_;  // guarded by mutex_
+  bool closed_ = false;           // guarded by mutex_
+};
+
+// Opens a subscription to rows of every table pushed from now on.
+std::shared_ptr<EventSubscription> SubscribeEvents();
+
+// Forgets every ring (tests only). Open subscriptions stay open.
+void ResetEventsForTesting();
+
+}  // namespace fw

@@ -1,0 +1,30 @@
+#pragma once
+
+// The data-event endpoints of the HTTP API:
+//
+//   GET /api/v1/events          {"events": [row, ...]} oldest first; ?limit=N keeps the last N
+//   GET /api/v1/events/stream   server-sent events, one "data: row\n\n" per row pushed from now
+//
+// A row is a JSON object keyed by attribute name, text without its padding, as in table
+// samples. Each open stream holds one of the server's worker threads, so at most
+// kMaxEventStreams are served at once; more are refused with 503.
+//
+// Thread safety: InstallEventRoutes and EndEventStreams run on the thread that starts and stops
+// the server; the handlers run on its worker threads.
+
+namespace httplib {
+class Server;
+}
+
+namespace fw {
+
+inline constexpr int kMaxEventStreams = 4;
+
+// Adds the routes to *server; *server must outlive its listening.
+void InstallEventRoutes(httplib::Server& server);
+
+// Ends the open streams of *server within a fraction of a second and refuses new ones. Call it
+// before server.stop(), which otherwise waits forever for the streams' worker threads.
+void EndEventStreams(httplib::Server& server);
+
+}  // namespace fw
