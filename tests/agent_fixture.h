@@ -31,7 +31,9 @@ class AgentE2ETest : public ::testing::Test {
         {"Q7_HOME", home_.path()}, {"Q7_HTTP_ADDRESS", "127.0.0.1:0"},
         {"Q7_TRACE", "*=ALL"},     {"Q7_TRACE_FILE", ""},
         {"DPX_NOSTART", ""},       {"TZ", "UTC"}};
-    vars.insert(extraEnv_.begin(), extraEnv_.end());
+    for (const auto& [name, value] : extraEnv_) {
+      vars[name] = value;  // a test's own setting wins over the defaults above
+    }
     return vars;
   }
   std::string tracePath() const { return home_.path() + "logs/q7agent.log"; }

@@ -37,9 +37,10 @@ bool isDirectory(const std::string& path) {
 
 namespace {
 
-pid_t spawn(const std::vector<std::string>& args, const std::map<std::string, std::string>& env,
-            int stdout_fd) {
-  std::vector<std::string> argv_s{Q7AGENT_PATH};
+pid_t spawn(const std::string& program, const std::vector<std::string>& args,
+            const std::map<std::string, std::string>& env, int stdout_fd,
+            bool with_stderr = false) {
+  std::vector<std::string> argv_s{program};
   argv_s.insert(argv_s.end(), args.begin(), args.end());
   const pid_t pid = ::fork();
   if (pid == 0) {
@@ -48,6 +49,9 @@ pid_t spawn(const std::vector<std::string>& args, const std::map<std::string, st
     }
     if (stdout_fd >= 0) {
       ::dup2(stdout_fd, STDOUT_FILENO);
+      if (with_stderr) {
+        ::dup2(stdout_fd, STDERR_FILENO);
+      }
     }
     std::vector<char*> argv;
     for (auto& a : argv_s) {
@@ -64,7 +68,7 @@ pid_t spawn(const std::vector<std::string>& args, const std::map<std::string, st
 
 AgentProcess::AgentProcess(const std::vector<std::string>& args,
                            const std::map<std::string, std::string>& env)
-    : pid_(spawn(args, env, -1)) {}
+    : pid_(spawn(Q7AGENT_PATH, args, env, -1)) {}
 
 AgentProcess::~AgentProcess() {
   if (pid_ > 0 && !reaped_) {
@@ -105,13 +109,16 @@ bool waitFor(const std::function<bool()>& condition, std::chrono::milliseconds t
   return true;
 }
 
-int runToCompletion(const std::vector<std::string>& args,
-                    const std::map<std::string, std::string>& env, std::string* output) {
+namespace {
+
+int RunAndCollect(const std::string& program, const std::vector<std::string>& args,
+                  const std::map<std::string, std::string>& env, std::string* output,
+                  bool with_stderr) {
   int fds[2];
   if (::pipe(fds) != 0) {
     return -1;
   }
-  const pid_t pid = spawn(args, env, fds[1]);
+  const pid_t pid = spawn(program, args, env, fds[1], with_stderr);
   ::close(fds[1]);
   char buf[4096];
   ssize_t n;
@@ -122,6 +129,18 @@ int runToCompletion(const std::vector<std::string>& args,
   int status = 0;
   ::waitpid(pid, &status, 0);
   return status;
+}
+
+}  // namespace
+
+int runToCompletion(const std::vector<std::string>& args,
+                    const std::map<std::string, std::string>& env, std::string* output) {
+  return RunAndCollect(Q7AGENT_PATH, args, env, output, false);
+}
+
+int runProgram(const std::string& program, const std::vector<std::string>& args,
+               const std::map<std::string, std::string>& env, std::string* output) {
+  return RunAndCollect(program, args, env, output, true);
 }
 
 }  // namespace q7test

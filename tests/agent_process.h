@@ -63,6 +63,10 @@ class AgentProcess {
 // Polls a condition until it holds or the timeout passes.
 bool waitFor(const std::function<bool()>& condition, std::chrono::milliseconds timeout);
 
+// Runs another program to completion; its standard output and error go to *output.
+int runProgram(const std::string& program, const std::vector<std::string>& args,
+               const std::map<std::string, std::string>& env, std::string* output);
+
 // Runs the binary to completion and returns its exit status and standard output.
 int runToCompletion(const std::vector<std::string>& args,
                     const std::map<std::string, std::string>& env, std::string* output);
