@@ -8,6 +8,7 @@
 #include "tama/agent_details.h"
 #include "tama/agent_hooks.h"
 #include "tama/agent_message.h"
+#include "tama/service_monitor.h"
 
 namespace tama {
 
@@ -76,6 +77,7 @@ void installAgentHooks() {
   hooks.start_analyzer = [] { CDPXAnalyzer::GetInstance(); };
   hooks.shutdown_analyzer = [] { CDPXAnalyzer::GetInstanceNoStart()->Shutdown(); };
   hooks.join_analyzer = [] { CDPXAnalyzer::GetInstanceNoStart()->Join(); };
+  hooks.make_collector_monitor = &makeServiceMonitor;
   hooks.send_agent_message = [](const char* key, int severity,
                                 const std::vector<std::string>& args) {
     AgentMessage::sendMessage(key, severity, args);

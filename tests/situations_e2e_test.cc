@@ -52,9 +52,8 @@ class SituationsE2ETest : public AgentE2ETest {
     if (!bearer.empty()) {
       headers.emplace("Authorization", "Bearer " + bearer);
     }
-    const auto res = method == "PUT"
-                         ? client.Put(path.c_str(), headers, body, "application/json")
-                         : client.Delete(path.c_str(), headers);
+    const auto res = method == "PUT" ? client.Put(path.c_str(), headers, body, "application/json")
+                                     : client.Delete(path.c_str(), headers);
     if (!res) {
       return -1;
     }
@@ -63,9 +62,7 @@ class SituationsE2ETest : public AgentE2ETest {
     }
     return res->status;
   }
-  std::string patternFile() const {
-    return readFile(base() + "odi/dpx/tpatterns.dat");
-  }
+  std::string patternFile() const { return readFile(base() + "odi/dpx/tpatterns.dat"); }
 };
 
 TEST_F(SituationsE2ETest, PatternSituationsThroughQ7ctl) {
@@ -148,7 +145,8 @@ TEST_F(SituationsE2ETest, RefusedRequestsChangeNothingAndDisturbNoIngestion) {
   EXPECT_NE(std::string::npos, reply.find("not a whole number")) << reply;
   EXPECT_EQ(400, send(address, "PUT", path,
                       R"({"table": "Q7TXPTNS", "conditions": [{"column": "APPLICATIN",
-                          "value": ")" + std::string(200, 'a') + R"("}]})",
+                          "value": ")" +
+                          std::string(200, 'a') + R"("}]})",
                       token(), &reply));
   EXPECT_NE(std::string::npos, reply.find("the column holds 128")) << reply;
   EXPECT_EQ(400, send(address, "PUT", path, R"({"table": "Q7NOPE"})", token(), &reply));
