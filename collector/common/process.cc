@@ -18,7 +18,21 @@ void OnStopSignal(int) {
   g_stop.store(true);
 }
 
+void UnblockStopSignals() {
+  sigset_t stop;
+  sigemptyset(&stop);
+  sigaddset(&stop, SIGINT);
+  sigaddset(&stop, SIGTERM);
+  sigprocmask(SIG_UNBLOCK, &stop, nullptr);
+}
+
 }  // namespace
+
+void RestoreStopSignals() {
+  signal(SIGINT, SIG_DFL);
+  signal(SIGTERM, SIG_DFL);
+  UnblockStopSignals();
+}
 
 void InstallStopHandlers() {
   struct sigaction action {};
@@ -28,11 +42,7 @@ void InstallStopHandlers() {
   sigaction(SIGINT, &action, nullptr);
   sigaction(SIGTERM, &action, nullptr);
   signal(SIGPIPE, SIG_IGN);
-  sigset_t stop;
-  sigemptyset(&stop);
-  sigaddset(&stop, SIGINT);
-  sigaddset(&stop, SIGTERM);
-  sigprocmask(SIG_UNBLOCK, &stop, nullptr);
+  UnblockStopSignals();
 }
 
 bool StopRequested() {

@@ -11,10 +11,13 @@
 namespace collector {
 
 // Undoes what the agent and a non-interactive shell hand us: SIGINT and SIGTERM blocked (the
-// agent's mask survives fork and exec) and SIGINT ignored (background jobs of sh). Then
-// installs a handler for both that only records the request, without SA_RESTART, so blocking
-// calls return EINTR and the main loop sees it. SIGPIPE is ignored: a vanished reader shows as
-// EPIPE. Call first thing in main.
+// agent's mask survives fork and exec) and SIGINT ignored (background jobs of sh). Both get
+// their default action back and are unblocked. Call first thing in main.
+void RestoreStopSignals();
+
+// Installs a handler for SIGINT and SIGTERM that only records the request, without
+// SA_RESTART, so blocking calls return EINTR and the main loop sees it, and unblocks both.
+// SIGPIPE is ignored: a vanished reader shows as EPIPE.
 void InstallStopHandlers();
 
 // True once SIGINT or SIGTERM arrived.

@@ -27,6 +27,7 @@ constexpr int kUsageError = 2;
 }  // namespace
 
 int main(int argc, char** argv) {
+  collector::RestoreStopSignals();
   collector::InstallStopHandlers();
 
   CLI::App app{"sm3writer: appends the capture process's records to the collector's data files",
