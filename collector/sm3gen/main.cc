@@ -81,7 +81,8 @@ int main(int argc, char** argv) {
       app.add_option("--out", job.out_path, "Output file, - for standard output (file mode)");
   CLI::Option* records_option =
       app.add_option("--records", job.records,
-                     "Complete records to write, all kinds counted (live mode: 0 = no end)")
+                     "Complete records to write, all kinds counted (--live: stop after this many "
+                     "written; no end when not given)")
           ->capture_default_str()
           ->check(CLI::Range(int64_t{0}, int64_t{100000000}));
   app.add_option("--seed", model.seed, "Random seed")->capture_default_str();
