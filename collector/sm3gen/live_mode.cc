@@ -58,6 +58,14 @@ class Outbox {
     if (records_.empty()) {
       bytes_.clear();
       sent_ = begun_ = 0;
+    } else if (begun_ >= kMaxBacklog) {
+      // A FIFO that never quite empties would otherwise keep every byte ever sent.
+      bytes_.erase(0, begun_);
+      for (Pending& pending : records_) {
+        pending.end -= begun_;
+      }
+      sent_ -= begun_;
+      begun_ = 0;
     }
     return done;
   }

@@ -6,6 +6,7 @@
 #include <signal.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <cstdio>
 
 #include "collector/common/process.h"
@@ -20,15 +21,21 @@ using Clock = LiveFile::Clock;
 // Also bounds how late an age roll or a truth rewrite can be.
 constexpr int kPollMs = 100;
 constexpr size_t kReadSize = 64 * 1024;
+// Bounds one round of reading, so the loop still ticks under a flood.
+constexpr std::chrono::milliseconds kDrainLimit(kPollMs);
+// At a stop, well inside the 5 s sm3ctl waits before it kills.
+constexpr std::chrono::milliseconds kFinalDrainLimit(2000);
 
 void Report(const std::string& text) {
   std::fprintf(stderr, "sm3writer: %s\n", text.c_str());
 }
 
-// Reads what the FIFO holds now into the appender. False on a read error other than "empty".
-bool Drain(int fd, RecordAppender* appender) {
+// Reads what the FIFO holds now into the appender, for at most limit (a producer may keep it
+// full). False on a read error other than "empty".
+bool Drain(int fd, RecordAppender* appender, std::chrono::milliseconds limit) {
+  const Clock::time_point deadline = Clock::now() + limit;
   std::string buffer(kReadSize, '\0');
-  while (true) {
+  while (Clock::now() < deadline) {
     const ssize_t n = ::read(fd, buffer.data(), buffer.size());
     if (n < 0 && errno == EINTR) {
       continue;
@@ -47,6 +54,7 @@ bool Drain(int fd, RecordAppender* appender) {
       Report(error);
     }
   }
+  return true;
 }
 
 }  // namespace
@@ -88,7 +96,7 @@ void Writer::Run() {
     if (ready < 0 && errno != EINTR) {
       Report(ErrnoText("poll"));
     }
-    if (ready > 0 && !Drain(fifo_.get(), &appender)) {
+    if (ready > 0 && !Drain(fifo_.get(), &appender, kDrainLimit)) {
       // Avoid spinning on a FIFO that keeps failing.
       ::usleep(kPollMs * 1000);
     }
@@ -99,7 +107,7 @@ void Writer::Run() {
   }
 
   // Records a capture process finished writing before it stopped are still in the FIFO.
-  Drain(fifo_.get(), &appender);
+  Drain(fifo_.get(), &appender, kFinalDrainLimit);
   std::string failure;
   if (!appender.Finish(Clock::now(), &failure)) {
     Report(failure);
