@@ -1,6 +1,7 @@
 #!/bin/sh
-# Lays out a q7agent home at $PREFIX: bin/ (installed by cmake), lib/, config/, logs/ and
-# the collector data directory zorvan6/dpx/data/.
+# Lays out a q7agent home at $PREFIX: bin/ (installed by cmake), lib/, config/, logs/, the
+# collector's directory zorvan6/dpx/ (sm3ctl installed by cmake, its sm3ctl.conf, linux/ for
+# pid files and the FIFO) and its data directory zorvan6/dpx/data/.
 # Existing configuration files are kept: an operator's edits are never overwritten.
 set -eu
 : "${PREFIX:?PREFIX must name the home directory}"
@@ -10,6 +11,7 @@ home="${PREFIX%/}/"
 mkdir -p "${home}bin" "${home}lib" "${home}config" "${home}logs"
 # The collector's data directory named by the default KQ7DPXLOGPATH.
 mkdir -p "${home}zorvan6/dpx/data"
+mkdir -p "${home}zorvan6/dpx/linux"
 
 host=$(uname -n | cut -c1-24 | cut -d. -f1)
 install_once() {  # install_once SOURCE TARGET
@@ -23,3 +25,4 @@ install_once() {  # install_once SOURCE TARGET
 install_once "$here/host_q7.cfg" "${home}config/${host}_q7.cfg"
 install_once "$here/q7details.properties" "${home}config/q7details.properties"
 install_once "$here/q7.env" "${home}config/q7.env"
+install_once "$here/../collector/sm3ctl.conf.in" "${home}zorvan6/dpx/sm3ctl.conf"
