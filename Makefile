@@ -88,13 +88,12 @@ install: build
 	cmake --install build --prefix "$(PREFIX)"
 	PREFIX="$(PREFIX)" resources/install-home.sh
 
-DEMO_HOME := $(CURDIR)/demo-home
+DEMO_HOME ?= $(CURDIR)/demo-home
 demo: build
+	@resources/demo.sh --check "$(DEMO_HOME)"
 	@$(MAKE) --no-print-directory install PREFIX="$(DEMO_HOME)" >/dev/null
 	@echo "q7agent demo: home $(DEMO_HOME)/, API on http://127.0.0.1:7420 (Ctrl-C stops it)"
-	@echo "  try: curl -s http://127.0.0.1:7420/healthz ; curl -s http://127.0.0.1:7420/api/v1/agent"
-	@Q7_HOME="$(DEMO_HOME)/" Q7_TRACE_FILE=- Q7_TRACE="$${Q7_TRACE:-*=ERROR|SUMMARY}" \
-	  DPX_NOSTART=1 "$(DEMO_HOME)/bin/q7agent"
+	@resources/demo.sh "$(DEMO_HOME)"
 
 format:
 	clang-format -i $$(git ls-files '*.h' '*.cc')
