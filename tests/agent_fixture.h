@@ -34,6 +34,9 @@ class AgentE2ETest : public ::testing::Test {
     for (const auto& [name, value] : extraEnv_) {
       vars[name] = value;  // a test's own setting wins over the defaults above
     }
+    if (superviseCollector_) {
+      vars.erase("DPX_NOSTART");
+    }
     return vars;
   }
   std::string tracePath() const { return home_.path() + "logs/q7agent.log"; }
@@ -128,6 +131,7 @@ class AgentE2ETest : public ::testing::Test {
   TempHome home_;
   std::unique_ptr<AgentProcess> agent_;
   std::map<std::string, std::string> extraEnv_;
+  bool superviseCollector_ = false;  // true: the agent starts and stops the collector processes
 };
 
 }  // namespace q7test

@@ -1,0 +1,112 @@
+// The agent with the simulated collector: it starts the writer and the capture process through
+// sm3ctl, reads a minute of traffic at 2000 records per second across many rollovers, stops
+// them at shutdown, and after a restart that reads what was left its tables hold exactly what
+// reached the files.
+
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/stat.h>
+
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <nlohmann/json.hpp>
+#include <string>
+#include <thread>
+
+#include "tests/agent_fixture.h"
+#include "tests/agent_process.h"
+
+namespace q7test {
+namespace {
+
+using namespace std::chrono_literals;
+
+class CollectorE2ETest : public AgentE2ETest {
+ protected:
+  // Lays out <base>/dpx/ as an installation does: sm3ctl, its configuration and linux/.
+  void installCollector(const std::string& data) {
+    const std::string dpx = base() + "dpx/";
+    std::filesystem::create_directories(dpx + "linux");
+    std::filesystem::copy_file(SM3CTL_PATH, dpx + "sm3ctl");
+    std::filesystem::permissions(dpx + "sm3ctl", std::filesystem::perms::owner_all,
+                                 std::filesystem::perm_options::add);
+    const std::string bin = std::filesystem::path(SM3GEN_PATH).parent_path().string();
+    std::ofstream(dpx + "sm3ctl.conf")
+        << "MODE=simulate\nDATA_DIR=" << data << "\nRATE=2000\nSTEM=traffic\nROLL_BYTES=3000000\n"
+        << "ROLL_SECONDS=3600\nBIN_DIR=" << bin << "\nTRUTH_DIR=" << truthDir() << "\nSEED=11\n";
+    std::filesystem::create_directories(truthDir());
+  }
+  std::string truthDir() const { return home_.path() + "truth"; }
+  std::string pidFile(const std::string& prefix) const {
+    return base() + "dpx/linux/" + prefix + shortHostName() + ".pid";
+  }
+};
+
+TEST_F(CollectorE2ETest, AMinuteOfSimulatedTrafficCountedExactly) {
+  const std::string data = useDataDirectory();
+  installCollector(data);
+  registerCatchAllPattern();
+  superviseCollector_ = true;
+  const std::string address = start();
+
+  std::this_thread::sleep_for(30s);
+  // Both processes run, named by their pid files.
+  EXPECT_FALSE(readFile(pidFile("zolt414_")).empty());
+  EXPECT_FALSE(readFile(pidFile("zelt_")).empty());
+  std::this_thread::sleep_for(30s);
+
+  // The agent stops the writer, then the capture process, then itself.
+  agent_->signal(SIGTERM);
+  const auto status = agent_->wait(30s);
+  ASSERT_TRUE(status.has_value()) << "agent did not exit";
+  EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 0);
+  EXPECT_FALSE(std::filesystem::exists(pidFile("zolt414_")));
+  EXPECT_FALSE(std::filesystem::exists(pidFile("zelt_")));
+  int rolled = 0;
+  for (const auto& entry : std::filesystem::directory_iterator(data)) {
+    rolled += entry.path().filename().string().find('-') != std::string::npos ? 1 : 0;
+  }
+  EXPECT_GE(rolled, 5) << "the live file should have rolled over several times";
+
+  // What reached the files, per application.
+  const nlohmann::json truth =
+      nlohmann::json::parse(readFile(truthDir() + "/sm3writer.json"), nullptr, false);
+  ASSERT_FALSE(truth.is_discarded());
+  std::map<std::string, long> expected;
+  long pages = 0;
+  for (const auto& [app, figures] : truth["applications"].items()) {
+    if (const long n = figures["pages"]["count"].get<long>(); n > 0) {
+      expected[app] = n;
+      pages += n;
+    }
+  }
+  ASSERT_GT(pages, 10000);  // pages are about one record in seven
+
+  // Restarted without the collector, the agent reads what it had not read yet.
+  superviseCollector_ = false;
+  const std::string again = start();
+  int code = 0;
+  nlohmann::json summary;
+  EXPECT_TRUE(waitFor(
+      [&] {
+        summary = get(again, "/api/v1/tables/Q7TXSM", &code);
+        return totalRequests(summary) >= pages;
+      },
+      30s))
+      << totalRequests(summary) << " of " << pages;
+  std::this_thread::sleep_for(1500ms);
+  summary = get(again, "/api/v1/tables/Q7TXSM", &code);
+  EXPECT_EQ(pages, totalRequests(summary));
+  const nlohmann::json apps = get(again, "/api/v1/tables/Q7APPSM", &code);
+  std::map<std::string, long> counted;
+  for (const auto& row : apps["rows"]) {
+    counted[row["applicatin"].get<std::string>()] += row["totreq"].get<long>();
+  }
+  EXPECT_EQ(expected, counted);
+  stopWith(SIGTERM);
+}
+
+}  // namespace
+}  // namespace q7test
