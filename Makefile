@@ -61,12 +61,13 @@ tsan: deps
 
 # The concurrency code under ThreadSanitizer (part of make test): the runtime primitives, the
 # situation controller shared by framework threads and the analyzer, the analyzer thread, the
-# intake threads (data file monitors and the file manager), and the framework's event rings,
-# event streams and situations.
+# intake threads (data file monitors and the file manager), the framework's event rings,
+# event streams and situations, and the collector process monitors.
 test-tsan: deps
 	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON
-	cmake --build build-tsan -j $(JOBS) --target runtime_test analyzer_test framework_test
+	cmake --build build-tsan -j $(JOBS) --target runtime_test analyzer_test framework_test tama_test
 	build-tsan/bin/runtime_test --gtest_brief=1
+	build-tsan/bin/tama_test --gtest_brief=1 --gtest_filter='ServiceMonitor*'
 	build-tsan/bin/framework_test --gtest_brief=1 --gtest_filter='Events*:Situations*'
 	build-tsan/bin/analyzer_test --gtest_brief=1 --gtest_filter='Situation*:Processing*:WaitFor*:DataFileMonitor*:FileManager*'
 
