@@ -30,6 +30,9 @@ Files:
   <configdir><host>_q7.cfg         framework configuration (KQ7DPXLOGPATH, ...)
   <configdir>q7details.properties  agent properties (NAME=VALUE lines)
   <configdir>q7.env                NAME=VALUE lines for framework variables
+  <configdir>q7_api_token          bearer token for API changes (created at first start)
+  <configdir>q7_situations.json    the started situations (kept across restarts)
+  <base>/dpx/sm3ctl                the collector's control script (<base> = <home>zorvan6)
 The agent runs in the foreground until SIGINT or SIGTERM.)";
 
 void setEnvFromOption(const char* name, const std::string& value) {
