@@ -86,15 +86,6 @@ bool ParseInteger(std::string_view text, std::int64_t* value) {
   return error == std::errc() && end == text.data() + text.size();
 }
 
-nlohmann::ordered_json ToJson(const SituationInfo& info) {
-  nlohmann::ordered_json conditions = nlohmann::ordered_json::array();
-  for (const Condition& c : info.conditions) {
-    conditions.push_back(
-        {{"column", c.column}, {"op", std::string(ConditionOpName(c.op))}, {"value", c.value}});
-  }
-  return {{"name", info.name}, {"table", info.table}, {"conditions", std::move(conditions)}};
-}
-
 // Writes the list to the file: a temporary file in the same directory, flushed, then renamed,
 // so a crash leaves the old list or the new one, never half of one. Registry mutex held.
 int Persist(const Registry& registry, std::string* error) {
@@ -103,7 +94,7 @@ int Persist(const Registry& registry, std::string* error) {
   }
   nlohmann::ordered_json list = nlohmann::ordered_json::array();
   for (const Started& s : registry.started) {
-    list.push_back(ToJson(s.info));
+    list.push_back(SituationToJson(s.info));
   }
   const std::string text =
       list.dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace) + "\n";
@@ -139,6 +130,15 @@ Started Prepare(SituationInfo info, std::shared_ptr<const TableDefinition> table
 }
 
 }  // namespace
+
+nlohmann::ordered_json SituationToJson(const SituationInfo& info) {
+  nlohmann::ordered_json conditions = nlohmann::ordered_json::array();
+  for (const Condition& c : info.conditions) {
+    conditions.push_back(
+        {{"column", c.column}, {"op", std::string(ConditionOpName(c.op))}, {"value", c.value}});
+  }
+  return {{"name", info.name}, {"table", info.table}, {"conditions", std::move(conditions)}};
+}
 
 int CheckSituation(std::string_view name, std::string_view table_name,
                    const std::vector<ConditionText>& conditions, SituationInfo* out,

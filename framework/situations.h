@@ -12,6 +12,7 @@
 // Thread safety: every function may be called from any thread; starts and stops are serialised,
 // so a table's agent objects see one situation change at a time.
 
+#include <nlohmann/json.hpp>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -27,6 +28,10 @@ struct SituationInfo {
   std::string table;
   std::vector<Condition> conditions;
 };
+
+// {"name": ..., "table": ..., "conditions": [{"column", "op", "value"}, ...]}, as the API
+// shows a situation and the situations file keeps it.
+nlohmann::ordered_json SituationToJson(const SituationInfo& info);
 
 // The longest situation name.
 inline constexpr std::size_t kMaxSituationNameLength = 64;

@@ -16,15 +16,6 @@ namespace {
 // The name part of the paths: anything up to the next '/', checked by CheckSituation.
 constexpr char kNamedPath[] = R"(/api/v1/situations/([^/]+))";
 
-nlohmann::ordered_json ToJson(const SituationInfo& info) {
-  nlohmann::ordered_json conditions = nlohmann::ordered_json::array();
-  for (const Condition& c : info.conditions) {
-    conditions.push_back(
-        {{"column", c.column}, {"op", std::string(ConditionOpName(c.op))}, {"value", c.value}});
-  }
-  return {{"name", info.name}, {"table", info.table}, {"conditions", std::move(conditions)}};
-}
-
 // Reads the body of a PUT into table and conditions; false with *error naming the problem.
 bool ParseBody(const std::string& body, std::string* table, std::vector<ConditionText>* conditions,
                std::string* error) {
@@ -80,7 +71,7 @@ bool ParseBody(const std::string& body, std::string* table, std::vector<Conditio
 void List(const httplib::Request&, httplib::Response& res) {
   nlohmann::ordered_json list = nlohmann::ordered_json::array();
   for (const SituationInfo& info : ListSituations()) {
-    list.push_back(ToJson(info));
+    list.push_back(SituationToJson(info));
   }
   ReplyJson(res, 200, nlohmann::ordered_json{{"situations", std::move(list)}});
 }
@@ -101,7 +92,7 @@ void Start(const httplib::Request& req, httplib::Response& res) {
     return;
   }
   bool replaced = false;
-  const nlohmann::ordered_json body = ToJson(info);
+  const nlohmann::ordered_json body = SituationToJson(info);
   const int started = StartSituation(std::move(info), &replaced, &error);
   if (started == kIoError) {
     ReplyError(res, 500, "situation " + name + " started but not saved: " + error);

@@ -11,6 +11,7 @@
 #include <string>
 #include <string_view>
 #include <utility>
+#include <vector>
 
 #include "framework/trace.h"
 #include "q7tema/row_query.h"
@@ -215,23 +216,69 @@ bool deregisterClientPattern(const char* situation) {
   return hooks.deregisterClient && hooks.deregisterClient(situation);
 }
 
-// ---- Q7TXPTNS ----
+// ---- The two tables ----
 
 namespace {
 
-constexpr std::array<const char*, 4> kTransactionTexts = {"APPLICATIN", "APPPATTERN", "TRANSACTN",
-                                                          "TRANSPATTN"};
-constexpr std::array<const char*, 6> kTransactionNumbers = {
-    "AGGAPSUNIQ", "AGGTXSUNIQ", "COLLINSTCS", "SAMPERCENT", "IMPORTANCE", "MRTTHRES"};
-// Settings an operator leaves out when giving only the four texts.
-constexpr std::array<int32_t, 6> kTransactionDefaults = {0, 1, 0, 100, 99, 10000000};
-constexpr std::array<const char*, 4> kTransactionMissing = {
-    "\t Application Name was not defined", "\t Application Pattern was not defined",
-    "\t Transaction Name was not defined", "\t Transaction Pattern was not defined"};
+// What one pattern table's situations are made of: the text and number columns, the numbers
+// that default when only the texts are given, the trace line for each missing text, and how a
+// complete set is registered and a situation's patterns removed.
+template <std::size_t Texts, std::size_t Numbers>
+struct PatternTable {
+  using Set = Settings<Texts, Numbers>;
+  std::array<const char*, Texts> texts;
+  std::array<const char*, Numbers> numbers;
+  std::array<int32_t, Numbers> defaults;
+  std::array<const char*, Texts> missing;
+  const char* errorKey;  // the operator message when the situation defines nothing
+  bool (*add)(const char* situation, const Set& settings);
+  bool (*remove)(const char* situation);
+};
 
-using TransactionSettings = Settings<4, 6>;
+// A situation defines patterns: each complete set of settings registers one at once; only the
+// texts register one with the defaults; nothing registered is reported.
+template <std::size_t Texts, std::size_t Numbers>
+void DefinePatterns(const PatternTable<Texts, Numbers>& table, const char* situation,
+                    const std::vector<fw::Condition>& conditions) {
+  using Set = Settings<Texts, Numbers>;
+  // A situation started again replaces what it defined before.
+  table.remove(situation);
+  Set settings;
+  bool attempted = false;
+  bool added = false;
+  for (const fw::Condition& condition : conditions) {
+    if (const int t = IndexOf(table.texts, condition.column); t >= 0) {
+      settings.texts[static_cast<std::size_t>(t)] = ValueText(condition);
+    } else if (const int n = IndexOf(table.numbers, condition.column); n >= 0) {
+      settings.numbers[static_cast<std::size_t>(n)] =
+          getFilterIntValue(condition.value.c_str(), condition.value_length);
+    }
+    if (settings.complete()) {
+      attempted = true;
+      added = table.add(situation, settings) || added;
+      settings = Set();
+    }
+  }
+  if (!attempted && settings.textsComplete()) {
+    for (std::size_t i = 0; i < Numbers; ++i) {
+      settings.numbers[i] = settings.numbers[i].value_or(table.defaults[i]);
+    }
+    attempted = true;
+    added = table.add(situation, settings);
+  }
+  if (!attempted) {
+    std::array<const char*, Texts> missing{};
+    for (std::size_t i = 0; i < Texts; ++i) {
+      missing[i] = settings.texts[i] ? nullptr : table.missing[i];
+    }
+    ReportNothingAdded(situation, missing.data(), missing.size());
+  }
+  if (!added) {
+    SendPatternError(table.errorKey, situation);
+  }
+}
 
-bool RegisterTransaction(const char* situation, const TransactionSettings& s) {
+bool AddTransactionPattern(const char* situation, const Settings<4, 6>& s) {
   return registerTransactionPattern(
       situation, s.texts[0]->c_str(), s.texts[1]->c_str(), s.texts[2]->c_str(), s.texts[3]->c_str(),
       static_cast<int16_t>(*s.numbers[0]), static_cast<int16_t>(*s.numbers[1]),
@@ -239,51 +286,53 @@ bool RegisterTransaction(const char* situation, const TransactionSettings& s) {
       static_cast<int16_t>(*s.numbers[4]));
 }
 
+bool AddClientPattern(const char* situation, const Settings<3, 1>& s) {
+  return registerClientPattern(situation, s.texts[0]->c_str(), s.texts[1]->c_str(),
+                               s.texts[2]->c_str(), static_cast<int16_t>(*s.numbers[0]));
+}
+
+const PatternTable<4, 6> kTransactionTable = {
+    {"APPLICATIN", "APPPATTERN", "TRANSACTN", "TRANSPATTN"},
+    {"AGGAPSUNIQ", "AGGTXSUNIQ", "COLLINSTCS", "SAMPERCENT", "IMPORTANCE", "MRTTHRES"},
+    {0, 1, 0, 100, 99, 10000000},
+    {"\t Application Name was not defined", "\t Application Pattern was not defined",
+     "\t Transaction Name was not defined", "\t Transaction Pattern was not defined"},
+    "RT_AGENT_TRANSACTION_PATTERN_ERROR",
+    &AddTransactionPattern,
+    &deregisterTransactionPattern};
+
+const PatternTable<3, 1> kClientTable = {
+    {"CLIENTNA", "CLIENTHOPT", "CLIENTPPT"},
+    {"AGGUNIQLY"},
+    {0},
+    {"\t Client Name was not defined", "\t Client Host Name Pattern was not defined",
+     "\t Client IP Pattern was not defined"},
+    "RT_AGENT_CLIENT_PATTERN_ERROR",
+    &AddClientPattern,
+    &deregisterClientPattern};
+
+// The three calls of a pattern table's agent object; where names it in traces.
+template <typename Row, std::size_t Texts, std::size_t Numbers>
+void Construct(TableBase<Row>& agent, const PatternTable<Texts, Numbers>& table,
+               const char* where) {
+  const fw::Request& r = *agent.request();
+  const char* situation = TraceSituation(where, r);
+  if (r.type == kSituationRequestType && situation != nullptr) {
+    DefinePatterns(table, situation, r.conditions);
+  }
+}
+
+template <typename Row, std::size_t Texts, std::size_t Numbers>
+void Destruct(TableBase<Row>& agent, const PatternTable<Texts, Numbers>& table, const char* where) {
+  if (const char* situation = TraceSituation(where, *agent.request())) {
+    table.remove(situation);
+  }
+}
+
 }  // namespace
 
 void TableAgent<kq7_q7txptns_data_t>::TakeSampleConstructor() {
-  const fw::Request& r = *request();
-  const char* situation = TraceSituation("kq7_q7txptns_agent::TakeSampleConstructor", r);
-  if (r.type != kSituationRequestType || situation == nullptr) {
-    return;
-  }
-  // A situation started again replaces what it defined before.
-  deregisterTransactionPattern(situation);
-  TransactionSettings settings;
-  bool attempted = false;
-  bool added = false;
-  for (const fw::Condition& condition : r.conditions) {
-    if (const int t = IndexOf(kTransactionTexts, condition.column); t >= 0) {
-      settings.texts[static_cast<std::size_t>(t)] = ValueText(condition);
-    } else if (const int n = IndexOf(kTransactionNumbers, condition.column); n >= 0) {
-      settings.numbers[static_cast<std::size_t>(n)] =
-          getFilterIntValue(condition.value.c_str(), condition.value_length);
-    }
-    if (settings.complete()) {
-      attempted = true;
-      added = RegisterTransaction(situation, settings) || added;
-      settings = TransactionSettings();
-    }
-  }
-  if (!attempted && settings.textsComplete()) {
-    for (std::size_t i = 0; i < settings.numbers.size(); ++i) {
-      if (!settings.numbers[i]) {
-        settings.numbers[i] = kTransactionDefaults[i];
-      }
-    }
-    attempted = true;
-    added = RegisterTransaction(situation, settings);
-  }
-  if (!attempted) {
-    std::array<const char*, 4> missing{};
-    for (std::size_t i = 0; i < missing.size(); ++i) {
-      missing[i] = settings.texts[i] ? nullptr : kTransactionMissing[i];
-    }
-    ReportNothingAdded(situation, missing.data(), missing.size());
-  }
-  if (!added) {
-    SendPatternError("RT_AGENT_TRANSACTION_PATTERN_ERROR", situation);
-  }
+  Construct(*this, kTransactionTable, "kq7_q7txptns_agent::TakeSampleConstructor");
 }
 
 void TableAgent<kq7_q7txptns_data_t>::TakeSample() {
@@ -292,68 +341,11 @@ void TableAgent<kq7_q7txptns_data_t>::TakeSample() {
 }
 
 void TableAgent<kq7_q7txptns_data_t>::TakeSampleDestructor() {
-  const char* situation = TraceSituation("kq7_q7txptns_agent::TakeSampleDestructor", *request());
-  if (situation != nullptr) {
-    deregisterTransactionPattern(situation);
-  }
+  Destruct(*this, kTransactionTable, "kq7_q7txptns_agent::TakeSampleDestructor");
 }
-
-// ---- Q7CLNTPTNS ----
-
-namespace {
-
-constexpr std::array<const char*, 3> kClientTexts = {"CLIENTNA", "CLIENTHOPT", "CLIENTPPT"};
-constexpr std::array<const char*, 1> kClientNumbers = {"AGGUNIQLY"};
-constexpr std::array<const char*, 3> kClientMissing = {
-    "\t Client Name was not defined", "\t Client Host Name Pattern was not defined",
-    "\t Client IP Pattern was not defined"};
-
-using ClientSettings = Settings<3, 1>;
-
-bool RegisterClient(const char* situation, const ClientSettings& s) {
-  return registerClientPattern(situation, s.texts[0]->c_str(), s.texts[1]->c_str(),
-                               s.texts[2]->c_str(), static_cast<int16_t>(*s.numbers[0]));
-}
-
-}  // namespace
 
 void TableAgent<kq7_q7clntptns_data_t>::TakeSampleConstructor() {
-  const fw::Request& r = *request();
-  const char* situation = TraceSituation("kq7_q7clntptns_agent::TakeSampleConstructor", r);
-  if (r.type != kSituationRequestType || situation == nullptr) {
-    return;
-  }
-  deregisterClientPattern(situation);
-  ClientSettings settings;
-  bool attempted = false;
-  bool added = false;
-  for (const fw::Condition& condition : r.conditions) {
-    if (const int t = IndexOf(kClientTexts, condition.column); t >= 0) {
-      settings.texts[static_cast<std::size_t>(t)] = ValueText(condition);
-    } else if (IndexOf(kClientNumbers, condition.column) >= 0) {
-      settings.numbers[0] = getFilterIntValue(condition.value.c_str(), condition.value_length);
-    }
-    if (settings.complete()) {
-      attempted = true;
-      added = RegisterClient(situation, settings) || added;
-      settings = ClientSettings();
-    }
-  }
-  if (!attempted && settings.textsComplete()) {
-    settings.numbers[0] = settings.numbers[0].value_or(0);
-    attempted = true;
-    added = RegisterClient(situation, settings);
-  }
-  if (!attempted) {
-    std::array<const char*, 3> missing{};
-    for (std::size_t i = 0; i < missing.size(); ++i) {
-      missing[i] = settings.texts[i] ? nullptr : kClientMissing[i];
-    }
-    ReportNothingAdded(situation, missing.data(), missing.size());
-  }
-  if (!added) {
-    SendPatternError("RT_AGENT_CLIENT_PATTERN_ERROR", situation);
-  }
+  Construct(*this, kClientTable, "kq7_q7clntptns_agent::TakeSampleConstructor");
 }
 
 void TableAgent<kq7_q7clntptns_data_t>::TakeSample() {
@@ -362,10 +354,7 @@ void TableAgent<kq7_q7clntptns_data_t>::TakeSample() {
 }
 
 void TableAgent<kq7_q7clntptns_data_t>::TakeSampleDestructor() {
-  const char* situation = TraceSituation("kq7_q7clntptns_agent::TakeSampleDestructor", *request());
-  if (situation != nullptr) {
-    deregisterClientPattern(situation);
-  }
+  Destruct(*this, kClientTable, "kq7_q7clntptns_agent::TakeSampleDestructor");
 }
 
 }  // namespace q7tema

@@ -8,51 +8,9 @@
 #include <new>
 
 #include "core/analyzer/common.h"
+#include "core/history/file_io.h"
 #include "core/runtime/clog.h"
 #include "tama/cconfig.h"
-
-namespace {
-
-// Closes a descriptor on every path out of a persist-file read.
-class FileDescriptor {
- public:
-  explicit FileDescriptor(int fd) : fd(fd) {}
-  ~FileDescriptor() {
-    if (fd >= 0) {
-      ::close(fd);
-    }
-  }
-  FileDescriptor(const FileDescriptor&) = delete;
-  FileDescriptor& operator=(const FileDescriptor&) = delete;
-  int get() const { return fd; }
-  // Closes now and returns close's result; the destructor then does nothing.
-  int release() {
-    const int result = ::close(fd);
-    fd = -1;
-    return result;
-  }
-
- private:
-  int fd;
-};
-
-// Reads up to size bytes, retrying interrupted and partial reads; the count read.
-long readFully(int fd, unsigned char* buffer, long size) {
-  long total = 0;
-  while (total < size) {
-    const ssize_t n = ::read(fd, buffer + total, static_cast<size_t>(size - total));
-    if (n < 0 && errno == EINTR) {
-      continue;
-    }
-    if (n <= 0) {
-      break;
-    }
-    total += n;
-  }
-  return total;
-}
-
-}  // namespace
 
 CFileManager::CFileManager(const char* threadName) : CvelThread(threadName) {
   setDirToWatch(CConfig::getDpxDataDirectory());
@@ -93,8 +51,8 @@ bool CFileManager::persistLastProcessedFile(_LAST_FILE_INFO* list) {
   CLOG::max("%s Need to persist to [%s] that the last file was[%s] and offset[%ld]", kWhere, path,
             list != nullptr ? list->fileName : "",
             list != nullptr ? static_cast<long>(list->fullOffset()) : 0L);
-  FileDescriptor fd(::open(path, O_RDWR | O_CREAT | O_TRUNC, 0600));
-  if (fd.get() < 0) {
+  history::UniqueFd fd(::open(path, O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
+  if (!fd.valid()) {
     CLOG::error("ERROR opening persist file[%s] errno[%d]", path, errno);
     return false;
   }
@@ -102,18 +60,16 @@ bool CFileManager::persistLastProcessedFile(_LAST_FILE_INFO* list) {
   for (_LAST_FILE_INFO* record = list; record != nullptr; record = record->next) {
     record->recordType = persistRecordType;
     const LastFileInfoBytes bytes = encodeLastFileInfo(*record);
-    const ssize_t written = ::write(fd.get(), bytes.data(), bytes.size());
-    if (written != static_cast<ssize_t>(bytes.size())) {
-      CLOG::error("\aERROR: Failed[%d] to write [%d] bytes", static_cast<int>(written),
-                  kLastFileInfoRecordSize);
+    if (!history::WriteAll(fd.get(), bytes.data(), bytes.size())) {
+      CLOG::error("\aERROR: Failed[%d] to write [%d] bytes", errno, kLastFileInfoRecordSize);
       ok = false;
       break;
     }
   }
   // The next start resumes from this record: make it survive a power cut.
   ::fsync(fd.get());
-  const int handle = fd.get();
-  if (fd.release() != 0) {
+  const int handle = fd.release();
+  if (::close(handle) != 0) {
     CLOG::error("ERROR failed[%d] to close persist file, handle[%d]", errno, handle);
     ok = false;
   }
@@ -127,16 +83,16 @@ _LAST_FILE_INFO* CFileManager::getLastProcessedFile() {
     CLOG::error("%s \aERROR, failed to get the persist file spec", kWhere);
     return nullptr;
   }
-  FileDescriptor fd(::open(path, O_RDONLY));
-  if (fd.get() < 0) {
+  history::UniqueFd fd(::open(path, O_RDONLY | O_CLOEXEC));
+  if (!fd.valid()) {
     CLOG::error("%s Failed[%d] to open the persist file[%s]", kWhere, errno, path);
     return nullptr;
   }
   CLOG::max("%s Opened the persist file [%s]", kWhere, path);
   _LAST_FILE_INFO* list = nullptr;
-  for (;;) {
+  for (off_t at = 0;; at += kLastFileInfoRecordSize) {
     LastFileInfoBytes bytes{};
-    const long got = readFully(fd.get(), bytes.data(), kLastFileInfoRecordSize);
+    const long got = static_cast<long>(history::ReadAt(fd.get(), bytes.data(), bytes.size(), at));
     if (got < kLastFileInfoRecordSize) {
       CLOG::max(
           "%s read of [%d] bytes failed, only read in [%d].  May be because of end of file "
