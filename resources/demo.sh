@@ -14,10 +14,10 @@ home="${home%/}/"
 bin="${home}bin"
 
 case "$home" in
-  *.* | *-*)
-    echo "make demo: the demo home $home holds a '.' or '-'." >&2
+  *.*)
+    echo "make demo: the demo home $home holds a '.'." >&2
     echo "  The agent orders collector files and finds renamed ones by cutting paths at the first" >&2
-    echo "  '.' and reading any '-' as a rename mark, so the data directory's path must hold neither." >&2
+    echo "  '.', so the demo's data directory must not hold one." >&2
     echo "  Put the demo elsewhere, for example:  make demo DEMO_HOME=/tmp/q7demo" >&2
     exit 2
     ;;
@@ -25,6 +25,21 @@ esac
 if $check_only; then
   exit 0
 fi
+
+# A '-' anywhere in the data directory's path reads as the mark of a renamed file, so a home
+# with one (demo-home itself) keeps its collector files in a directory of its own.
+data="${home}zorvan6/dpx/data"
+case "$home" in
+  *-*)
+    data="/tmp/q7demo_$(id -u)/data"
+    mkdir -p "$data"
+    for cfg in "${home}"config/*_q7.cfg; do
+      sed -i "s|^KQ7DPXLOGPATH=.*|KQ7DPXLOGPATH=$data|" "$cfg"
+    done
+    sed -i "s|^DATA_DIR=.*|DATA_DIR=$data|" "${home}zorvan6/dpx/sm3ctl.conf"
+    echo "make demo: collector files go to $data (the home's path holds a '-')" >&2
+    ;;
+esac
 
 export Q7_HOME="$home"
 ctl() { "$bin/q7ctl" "$@" >/dev/null; }
