@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/stat.h>
+#include <sys/utsname.h>
 
 #include <chrono>
 #include <filesystem>
@@ -39,8 +40,11 @@ class CollectorE2ETest : public AgentE2ETest {
     std::filesystem::create_directories(truthDir());
   }
   std::string truthDir() const { return home_.path() + "truth"; }
+  // Pid files are named after the node name's first 24 characters, dots kept.
   std::string pidFile(const std::string& prefix) const {
-    return base() + "dpx/linux/" + prefix + shortHostName() + ".pid";
+    struct utsname names {};
+    uname(&names);
+    return base() + "dpx/linux/" + prefix + std::string(names.nodename).substr(0, 24) + ".pid";
   }
 };
 
