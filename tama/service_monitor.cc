@@ -126,17 +126,17 @@ namespace {
 // Owns the strings and the null-terminated vectors the ServiceMonitor borrows.
 class ServiceMonitorAdapter : public CollectorMonitor {
  public:
-  explicit ServiceMonitorAdapter(const CollectorMonitorSpec& spec)
-      : pidFile(spec.pid_file),
-        startArgs(spec.start_argv),
-        stopArgs(spec.stop_argv),
-        envArgs(spec.env),
+  explicit ServiceMonitorAdapter(const CollectorMonitorSpec& settings)
+      : pidFile(settings.pid_file),
+        startArgs(settings.start_argv),
+        stopArgs(settings.stop_argv),
+        envArgs(settings.env),
         startArgv(Vector(startArgs)),
         stopArgv(Vector(stopArgs)),
         envp(Vector(envArgs)),
         monitor(pidFile.c_str(), startArgs.empty() ? "" : startArgs[0].c_str(), startArgv.data(),
                 stopArgs.empty() ? "" : stopArgs[0].c_str(), stopArgv.data(),
-                envArgs.empty() ? nullptr : envp.data(), spec.poll_seconds) {}
+                envArgs.empty() ? nullptr : envp.data(), settings.poll_seconds) {}
 
   int start() override {
     monitor.startMonitoring();
@@ -170,8 +170,8 @@ class ServiceMonitorAdapter : public CollectorMonitor {
 
 }  // namespace
 
-std::unique_ptr<CollectorMonitor> makeServiceMonitor(const CollectorMonitorSpec& spec) {
-  return std::make_unique<ServiceMonitorAdapter>(spec);
+std::unique_ptr<CollectorMonitor> makeServiceMonitor(const CollectorMonitorSpec& settings) {
+  return std::make_unique<ServiceMonitorAdapter>(settings);
 }
 
 }  // namespace tama

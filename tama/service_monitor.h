@@ -62,8 +62,8 @@ class ServiceMonitor {
 
 namespace tama {
 
-// A collector monitor for start-up: a ServiceMonitor over the spec's commands (copied and kept
+// A collector monitor for start-up: a ServiceMonitor over the given commands (copied and kept
 // alive by the returned object).
-std::unique_ptr<CollectorMonitor> makeServiceMonitor(const CollectorMonitorSpec& spec);
+std::unique_ptr<CollectorMonitor> makeServiceMonitor(const CollectorMonitorSpec& settings);
 
 }  // namespace tama
