@@ -7,7 +7,8 @@
 #   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/
 #   make asan / make tsan   sanitizer builds with their unit tests
 #   make test-tsan          the concurrency tests (runtime, situations, analyzer) under TSan
-#   make fuzz     clang libFuzzer build of the record parser, run for FUZZ_SECONDS (default 60)
+#   make fuzz     clang libFuzzer builds of the record parser, the HTTP parser and the capture
+#                 pipeline, each run for FUZZ_SECONDS (default 60)
 
 SHELL := /bin/bash
 BUILD_TYPE ?= RelWithDebInfo
@@ -19,7 +20,8 @@ DEPS := cmake ninja-build g++ make pkg-config git curl \
         libgtest-dev libgmock-dev libbenchmark-dev \
         libssl-dev zlib1g-dev libbrotli-dev libicu-dev icu-devtools \
         libcpp-httplib-dev nlohmann-json3-dev libspdlog-dev libfmt-dev \
-        libcli11-dev libinih-dev clang libclang-rt-14-dev
+        libcli11-dev libinih-dev clang libclang-rt-14-dev \
+        libpcap-dev tshark tcpdump nginx-light pcapfix python3-dpkt
 
 SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
 
@@ -77,17 +79,26 @@ bench: deps
 	@for b in build-release/bin/bench_*; do [ -x "$$b" ] && "$$b"; done; true
 
 FUZZ_SECONDS ?= 60
+FUZZ_TARGETS := sm3_fuzz http_parser_fuzz capture_fuzz
 fuzz: deps
 	cmake -S . -B build-fuzz $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=RelWithDebInfo \
 	  -DCMAKE_C_COMPILER=clang -DCMAKE_CXX_COMPILER=clang++ -DQ7_FUZZ=ON -DQ7_BUILD_TESTS=OFF
-	cmake --build build-fuzz -j $(JOBS) --target sm3_fuzz
-	mkdir -p build-fuzz/corpus
+	cmake --build build-fuzz -j $(JOBS) --target $(FUZZ_TARGETS)
+	mkdir -p build-fuzz/corpus build-fuzz/corpus_http_parser_fuzz build-fuzz/corpus_capture_fuzz
 	cd build-fuzz && bin/sm3_fuzz -max_total_time=$(FUZZ_SECONDS) -max_len=40000 \
 	  -print_final_stats=1 -dict=$(CURDIR)/tests/fuzz/sm3.dict corpus $(CURDIR)/tests/fuzz/seeds
+	cd build-fuzz && bin/http_parser_fuzz -max_total_time=$(FUZZ_SECONDS) -max_len=8192 \
+	  -print_final_stats=1 -dict=$(CURDIR)/tests/fuzz/http.dict corpus_http_parser_fuzz \
+	  $(CURDIR)/tests/fuzz/seeds_http_parser_fuzz
+	cd build-fuzz && bin/capture_fuzz -max_total_time=$(FUZZ_SECONDS) -max_len=16384 \
+	  -print_final_stats=1 -dict=$(CURDIR)/tests/fuzz/http.dict corpus_capture_fuzz \
+	  $(CURDIR)/tests/fuzz/seeds_capture_fuzz
 
 install: build
 	cmake --install build --prefix "$(PREFIX)"
 	PREFIX="$(PREFIX)" resources/install-home.sh
+	@echo "Live capture (sm3ctl.conf MODE=capture) needs CAP_NET_RAW: run the agent as root, or give"
+	@echo "sm3capture the capability once: setcap cap_net_raw,cap_net_admin=eip $(PREFIX)/bin/sm3capture"
 
 DEMO_HOME ?= $(CURDIR)/demo-home
 demo: build

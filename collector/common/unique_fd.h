@@ -29,6 +29,8 @@ class UniqueFd {
 
   int get() const { return fd_; }
   bool valid() const { return fd_ >= 0; }
+  // Gives up ownership without closing; returns the descriptor.
+  int release() { return std::exchange(fd_, -1); }
   // Closes the descriptor held, if any, and takes fd.
   void reset(int fd = -1) {
     if (fd_ >= 0) {
