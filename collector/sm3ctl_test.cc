@@ -9,12 +9,15 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <chrono>
+#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <functional>
 #include <map>
 #include <nlohmann/json.hpp>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -26,6 +29,42 @@ extern char** environ;
 namespace {
 
 namespace fs = std::filesystem;
+
+// Started through a link named sm3capture, this binary stands in for the capture program: it
+// writes its arguments, one a line, to sm3capture.args beside the link, keeps its pid file
+// while it runs and ends on SIGTERM like the real one. It must be a real executable because
+// sm3ctl recognises its processes by the name they were started under. Runs before main, so
+// GoogleTest never starts in the stand-in.
+const bool kStandInChecked = [] {
+  const std::string self = program_invocation_name;
+  if (fs::path(self).filename() != "sm3capture") {
+    return true;
+  }
+  std::ifstream in("/proc/self/cmdline", std::ios::binary);
+  std::vector<std::string> args;
+  for (std::string arg; std::getline(in, arg, '\0');) {
+    args.push_back(arg);
+  }
+  std::ofstream lines(fs::path(self).parent_path() / "sm3capture.args");
+  std::string pid_file;
+  for (size_t i = 1; i < args.size(); ++i) {
+    lines << args[i] << "\n";
+    if (args[i - 1] == "--pid-file") {
+      pid_file = args[i];
+    }
+  }
+  lines.close();
+  sigset_t stop;
+  sigemptyset(&stop);
+  sigaddset(&stop, SIGTERM);
+  sigprocmask(SIG_BLOCK, &stop, nullptr);
+  std::ofstream(pid_file) << getpid() << "\n";
+  // A minute at most, so that a test that dies before stopping it leaves nothing behind.
+  const timespec limit{60, 0};
+  sigtimedwait(&stop, nullptr, &limit);
+  std::remove(pid_file.c_str());
+  _exit(0);
+}();
 
 struct Result {
   int status = -1;  // exit status, -1 when it did not exit normally
@@ -256,12 +295,140 @@ TEST_F(Sm3ctlTest, ProgramsStopThoughStartedWithStopSignalsBlocked) {
   EXPECT_EQ('\n', root_.read("direct/traffic.sm3").back());
 }
 
-TEST_F(Sm3ctlTest, CaptureModeAndBadCommandsAreRefused) {
-  std::ofstream(dpx() + "/sm3ctl.conf", std::ios::app) << "MODE=capture\n";
-  const Result capture = Ctl("start", "collector");
-  EXPECT_EQ(1, capture.status);
-  EXPECT_NE(std::string::npos, capture.output.find("not available")) << capture.output;
+// A configuration with capture settings; the programs come from bin/, where sm3capture is this
+// test's stand-in and the others are the real ones.
+class Sm3ctlCaptureTest : public Sm3ctlTest {
+ protected:
+  void SetUp() override {
+    Sm3ctlTest::SetUp();
+    fs::create_directories(root_.file("bin"));
+    fs::create_symlink(fs::read_symlink("/proc/self/exe"), root_.file("bin/sm3capture"));
+    for (const char* program : {"sm3gen", "sm3writer"}) {
+      fs::create_symlink(std::string(SM3_BIN_DIR) + "/" + program, root_.file("bin/") + program);
+    }
+  }
+  // Later lines win over the defaults written by the base fixture.
+  void Configure(const std::string& lines) {
+    std::ofstream(dpx() + "/sm3ctl.conf", std::ios::app) << "BIN_DIR=../../bin\n" << lines;
+  }
+  // The stand-in's arguments, one a line; empty before it ran.
+  std::vector<std::string> CaptureArgs() const {
+    std::istringstream in(root_.read("bin/sm3capture.args"));
+    std::vector<std::string> args;
+    for (std::string arg; std::getline(in, arg);) {
+      args.push_back(arg);
+    }
+    return args;
+  }
+};
+
+// Capture mode runs sm3capture on the configured interface and filter, into the FIFO, with the
+// optional settings after the fixed ones; a filter with blanks (and its quotes) is one argument
+// while CAPTURE_OPTIONS splits at blanks; status and stop know the program.
+TEST_F(Sm3ctlCaptureTest, CaptureModeRunsSm3captureWithItsSettings) {
+  Configure(
+      "MODE=capture\nINTERFACE=lo\nFILTER='tcp port 8080 and host 10.0.0.1'\nSNAPLEN=512\n"
+      "CAPTURE_OPTIONS=--stats 60  --promiscuous\n");
+  const Result started = Ctl("start", "collector");
+  ASSERT_EQ(0, started.status) << started.output;
+  const std::vector<std::string> expected = {"--interface",  "lo",
+                                             "--filter",     "tcp port 8080 and host 10.0.0.1",
+                                             "--fifo",       dpx() + "/linux/sm3.fifo",
+                                             "--pid-file",   pid_files_.at("collector"),
+                                             "--snaplen",    "512",
+                                             "--stats",      "60",
+                                             "--promiscuous"};
+  EXPECT_EQ(expected, CaptureArgs());
+  const long pid = Pid("collector");
+  EXPECT_TRUE(Running(pid));
+
+  const Result status = Ctl("status", "");
+  EXPECT_NE(std::string::npos, status.output.find("collector is running (pid " +
+                                                  std::to_string(pid) + ", sm3capture)"))
+      << status.output;
+  const Result again = Ctl("start", "collector");
+  EXPECT_EQ(0, again.status);
+  EXPECT_NE(std::string::npos, again.output.find("already running")) << again.output;
+
+  const Result stopped = Ctl("stop", "collector");
+  EXPECT_EQ(0, stopped.status);
+  EXPECT_NE(std::string::npos, stopped.output.find("collector stopped")) << stopped.output;
+  EXPECT_EQ(std::string::npos, stopped.output.find("killing")) << stopped.output;
+  EXPECT_FALSE(Running(pid));
   EXPECT_FALSE(HasPidFile("collector"));
+}
+
+// Without FILTER the default web ports are captured; without SNAPLEN or CAPTURE_OPTIONS nothing
+// more is passed.
+TEST_F(Sm3ctlCaptureTest, DefaultFilterIsTheWebPorts) {
+  Configure("MODE=capture\nINTERFACE=eth0\n");
+  const Result started = Ctl("start", "collector");
+  ASSERT_EQ(0, started.status) << started.output;
+  const std::vector<std::string> expected = {"--interface", "eth0",
+                                             "--filter",    "tcp port 80 or tcp port 8080",
+                                             "--fifo",      dpx() + "/linux/sm3.fifo",
+                                             "--pid-file",  pid_files_.at("collector")};
+  EXPECT_EQ(expected, CaptureArgs());
+}
+
+// The mode may change while a collector runs: start leaves the running one alone (never two
+// programs writing into the FIFO) and stop ends whichever program it is.
+TEST_F(Sm3ctlCaptureTest, ModeChangeBetweenStartAndStop) {
+  Configure("MODE=simulate\n");
+  ASSERT_EQ(0, Ctl("start", "analyzer").status);
+  ASSERT_EQ(0, Ctl("start", "collector").status);
+  const long generator = Pid("collector");
+  ASSERT_TRUE(Running(generator));
+
+  Configure("MODE=capture\nINTERFACE=lo\n");
+  const Result kept = Ctl("start", "collector");
+  EXPECT_EQ(0, kept.status);
+  EXPECT_NE(std::string::npos, kept.output.find("already running as sm3gen")) << kept.output;
+  EXPECT_TRUE(CaptureArgs().empty());
+  EXPECT_EQ(generator, Pid("collector"));
+  Result stopped = Ctl("stop", "collector");
+  EXPECT_NE(std::string::npos, stopped.output.find("collector stopped")) << stopped.output;
+  EXPECT_FALSE(Running(generator));
+
+  // And back: sm3capture started in capture mode is stopped under MODE=simulate.
+  ASSERT_EQ(0, Ctl("start", "collector").status);
+  const long capture = Pid("collector");
+  ASSERT_TRUE(Running(capture));
+  Configure("MODE=simulate\n");
+  stopped = Ctl("stop", "collector");
+  EXPECT_NE(std::string::npos, stopped.output.find("collector stopped")) << stopped.output;
+  EXPECT_EQ(std::string::npos, stopped.output.find("killing")) << stopped.output;
+  EXPECT_FALSE(Running(capture));
+  EXPECT_FALSE(HasPidFile("collector"));
+}
+
+// Settings that cannot work are refused before anything starts, naming the key; stop still
+// works with them, and bad command lines exit 2.
+TEST_F(Sm3ctlCaptureTest, BadSettingsAndCommandsAreRefused) {
+  Configure("MODE=capture\n");
+  Result refused = Ctl("start", "collector");
+  EXPECT_EQ(1, refused.status);
+  EXPECT_NE(std::string::npos, refused.output.find("needs INTERFACE")) << refused.output;
+  EXPECT_TRUE(CaptureArgs().empty());
+  EXPECT_FALSE(HasPidFile("collector"));
+  EXPECT_EQ(0, Ctl("stop", "collector").status);
+
+  Configure("INTERFACE=lo\nSNAPLEN=big\n");
+  refused = Ctl("start", "collector");
+  EXPECT_EQ(1, refused.status);
+  EXPECT_NE(std::string::npos, refused.output.find("SNAPLEN")) << refused.output;
+
+  Configure("SNAPLEN=\nFILTER=\n");
+  refused = Ctl("start", "collector");
+  EXPECT_EQ(1, refused.status);
+  EXPECT_NE(std::string::npos, refused.output.find("FILTER")) << refused.output;
+
+  Configure("MODE=replay\n");
+  refused = Ctl("start", "collector");
+  EXPECT_EQ(1, refused.status);
+  EXPECT_NE(std::string::npos, refused.output.find("MODE must be")) << refused.output;
+  EXPECT_FALSE(HasPidFile("collector"));
+
   EXPECT_EQ(2, Ctl("start", "everything").status);
   EXPECT_EQ(2, Ctl("restart", "analyzer").status);
 }
