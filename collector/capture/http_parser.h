@@ -19,33 +19,10 @@
 #include <string>
 #include <string_view>
 
+#include "collector/capture/http_head.h"
 #include "collector/capture/tcp_segment.h"
 
 namespace capture {
-
-// The head of one message, with the fields the collector records. Header names match
-// case-insensitively; a repeated header keeps its first value (Content-Length excepted: see
-// content_length). Values have their surrounding blanks removed and are cut at kMaxFieldBytes.
-struct HttpHead {
-  static constexpr size_t kMaxFieldBytes = 4096;
-
-  std::string method;  // requests: the method token as sent ("GET")
-  std::string target;  // requests: the request-target as sent ("/a/b.html?x=1")
-  int version_major = 1;
-  int version_minor = 1;  // from "HTTP/1.1"
-  int status = 0;         // responses: the 3-digit status code
-  std::string host;
-  std::string referer;
-  std::string user_agent;
-  std::string server;
-  std::string content_type;
-  std::string connection;          // the Connection header's value as sent
-  int64_t content_length = -1;     // -1 when absent; a valid list of equal values counts once
-  bool chunked = false;            // Transfer-Encoding's last coding is "chunked"
-  bool transfer_encoding = false;  // a Transfer-Encoding header is present
-
-  void Clear();
-};
 
 // One message as seen on the wire.
 struct HttpMessageSpan {
@@ -61,7 +38,7 @@ struct HttpMessageSpan {
 
 class HttpParser {
  public:
-  enum class Kind { kRequest, kResponse };
+  using Kind = HttpMessageKind;
 
   enum class Desync {
     kNotHttp,       // the stream, seen from its start, does not begin with a start line
