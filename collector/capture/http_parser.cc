@@ -66,6 +66,11 @@ void HttpParser::Feed(const uint8_t* data, size_t size, Micros time) {
   ++feed_count_;
   time_ = time;
   head_pos_ = 0;
+  if (state_ == State::kResync) {
+    // Senders begin a message with a write of its own, so a segment's first byte is worth a
+    // look: a body seen from its middle rarely ends with a line end before the next message.
+    at_line_start_ = true;
+  }
   size_t pos = 0;
   while (pos < size) {
     switch (state_) {
