@@ -224,7 +224,14 @@ int main(int argc, char** argv) {
         PrintStats("stats: ", stats);
       }
     }
-    if (!output->Pump(&error)) {
+    bool pumped = output->Pump(&error);
+    // A file is read faster than any writer takes records: wait for the reader rather than
+    // lose them. Live traffic cannot wait, so there the queue's limit counts them lost.
+    while (pumped && !pcap.live() && output->Backlogged() && !collector::StopRequested()) {
+      output->WaitForRoom(std::chrono::milliseconds(100));
+      pumped = output->Pump(&error);
+    }
+    if (!pumped) {
       std::fprintf(stderr, "sm3capture: %s\n", error.c_str());
       status = 1;
       break;

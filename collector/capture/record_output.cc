@@ -5,6 +5,7 @@
 #include <poll.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <thread>
 
 #include "collector/common/process.h"
@@ -154,6 +155,15 @@ bool FifoOutput::Pump(std::string* error) {
     begun_ = 0;
   }
   return true;
+}
+
+void FifoOutput::WaitForRoom(std::chrono::milliseconds timeout) {
+  if (fd_.valid()) {
+    struct pollfd pfd = {fd_.get(), POLLOUT, 0};
+    ::poll(&pfd, 1, static_cast<int>(timeout.count()));
+  } else {
+    std::this_thread::sleep_for(std::min(timeout, kReconnect));
+  }
 }
 
 bool FifoOutput::Finish(std::chrono::steady_clock::time_point deadline, std::string* error) {

@@ -28,6 +28,10 @@ class RecordOutput : public RecordSink {
   virtual bool Pump(std::string* error) = 0;
   // Writes what is left, waiting at most until deadline; false with *error on failure.
   virtual bool Finish(std::chrono::steady_clock::time_point deadline, std::string* error) = 0;
+  // True while so much waits that a producer who can wait (a file being read) should: then
+  // WaitForRoom blocks up to timeout for the reader to take some.
+  virtual bool Backlogged() const { return false; }
+  virtual void WaitForRoom(std::chrono::milliseconds) {}
 };
 
 class FileOutput : public RecordOutput {
@@ -65,6 +69,9 @@ class FifoOutput : public RecordOutput {
   void Write(const sm3gen::Record& record) override;
   bool Pump(std::string* error) override;
   bool Finish(std::chrono::steady_clock::time_point deadline, std::string* error) override;
+
+  bool Backlogged() const override { return bytes_.size() - begun_ >= max_queued_ / 2; }
+  void WaitForRoom(std::chrono::milliseconds timeout) override;
 
   bool connected() const { return fd_.valid(); }
 
