@@ -129,7 +129,8 @@ TEST(PacketDecoderTest, EveryLinkTypeReachesTheSameSegment) {
 
 TEST(PacketDecoderTest, Ipv6WithExtensionHeader) {
   TcpSegment s;
-  ASSERT_EQ(Decode(1, Ethernet(Ipv6(Tcp("HTTP/1.1")), 0x86DD, 0), &s), DecodeResult::kTcp);
+  const Bytes frame = Ethernet(Ipv6(Tcp("HTTP/1.1")), 0x86DD, 0);  // s points into it
+  ASSERT_EQ(Decode(1, frame, &s), DecodeResult::kTcp);
   EXPECT_TRUE(s.src.v6);
   EXPECT_EQ(Payload(s), "HTTP/1.1");
   char text[64];
