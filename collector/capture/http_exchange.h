@@ -15,6 +15,9 @@ namespace capture {
 
 struct HttpExchange {
   ConnectionInfo connection;
+  // A client known by name rather than address (an access log written with host-name
+  // lookups): the record names it so; connection.client is then all zero.
+  std::string client_name;
   HttpHead request;
   HttpHead response;  // the final reply (an interim 1xx is counted, not kept)
 

@@ -160,7 +160,8 @@ sm3gen::Record RecordBuilder::Build(const HttpExchange& exchange, sm3gen::Record
   r.time_zone = zone_name_;
 
   const ConnectionInfo& c = exchange.connection;
-  r.client_address = Field(AddressText(c.client), kAddressWidth);
+  r.client_address = Field(
+      exchange.client_name.empty() ? AddressText(c.client) : exchange.client_name, kAddressWidth);
   r.client_port = c.client_port;
   r.server_address = Field(AddressText(c.server), kAddressWidth);
   r.server_port = c.server_port;
