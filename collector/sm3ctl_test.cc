@@ -9,6 +9,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstdio>
@@ -30,14 +31,15 @@ namespace {
 
 namespace fs = std::filesystem;
 
-// Started through a link named sm3capture, this binary stands in for the capture program: it
-// writes its arguments, one a line, to sm3capture.args beside the link, keeps its pid file
+// Started through a link named sm3capture or sm3logs, this binary stands in for that program: it
+// writes its arguments, one a line, to <name>.args beside the link, keeps its pid file
 // while it runs and ends on SIGTERM like the real one. It must be a real executable because
 // sm3ctl recognises its processes by the name they were started under. Runs before main, so
 // GoogleTest never starts in the stand-in.
 const bool kStandInChecked = [] {
   const std::string self = program_invocation_name;
-  if (fs::path(self).filename() != "sm3capture") {
+  const std::string name = fs::path(self).filename();
+  if (name != "sm3capture" && name != "sm3logs") {
     return true;
   }
   std::ifstream in("/proc/self/cmdline", std::ios::binary);
@@ -45,7 +47,7 @@ const bool kStandInChecked = [] {
   for (std::string arg; std::getline(in, arg, '\0');) {
     args.push_back(arg);
   }
-  std::ofstream lines(fs::path(self).parent_path() / "sm3capture.args");
+  std::ofstream lines(fs::path(self).parent_path() / (name + ".args"));
   std::string pid_file;
   for (size_t i = 1; i < args.size(); ++i) {
     lines << args[i] << "\n";
@@ -303,6 +305,7 @@ class Sm3ctlCaptureTest : public Sm3ctlTest {
     Sm3ctlTest::SetUp();
     fs::create_directories(root_.file("bin"));
     fs::create_symlink(fs::read_symlink("/proc/self/exe"), root_.file("bin/sm3capture"));
+    fs::create_symlink(fs::read_symlink("/proc/self/exe"), root_.file("bin/sm3logs"));
     for (const char* program : {"sm3gen", "sm3writer"}) {
       fs::create_symlink(std::string(SM3_BIN_DIR) + "/" + program, root_.file("bin/") + program);
     }
@@ -312,8 +315,8 @@ class Sm3ctlCaptureTest : public Sm3ctlTest {
     std::ofstream(dpx() + "/sm3ctl.conf", std::ios::app) << "BIN_DIR=../../bin\n" << lines;
   }
   // The stand-in's arguments, one a line; empty before it ran.
-  std::vector<std::string> CaptureArgs() const {
-    std::istringstream in(root_.read("bin/sm3capture.args"));
+  std::vector<std::string> CaptureArgs(const std::string& program = "sm3capture") const {
+    std::istringstream in(root_.read("bin/" + program + ".args"));
     std::vector<std::string> args;
     for (std::string arg; std::getline(in, arg);) {
       args.push_back(arg);
@@ -356,6 +359,47 @@ TEST_F(Sm3ctlCaptureTest, CaptureModeRunsSm3captureWithItsSettings) {
   EXPECT_EQ(std::string::npos, stopped.output.find("killing")) << stopped.output;
   EXPECT_FALSE(Running(pid));
   EXPECT_FALSE(HasPidFile("collector"));
+}
+
+// Access-log mode follows LOG_PATH (relative to the script) with a named format, or a format in
+// GoAccess's notation passed whole however many blanks it holds, keeping its position in linux/.
+TEST_F(Sm3ctlCaptureTest, AccessLogModeRunsSm3logsWithItsSettings) {
+  Configure(
+      "MODE=accesslog\nLOG_PATH=logs/access.log\nFORMAT=apache-timed\n"
+      "LOGS_OPTIONS=--host shop.example  --server-port 443\n");
+  ASSERT_EQ(0, Ctl("start", "collector").status);
+  const std::vector<std::string> args = CaptureArgs("sm3logs");
+  ASSERT_GE(args.size(), 10u);
+  EXPECT_EQ(args[0], "--follow");
+  EXPECT_EQ(args[1], dpx() + "/logs/access.log");
+  EXPECT_EQ(args[2], "--state");
+  EXPECT_EQ(args[3].rfind(dpx() + "/linux/sm3logs_", 0), 0u) << args[3];
+  const std::vector<std::string> rest(args.begin() + 4, args.end());
+  const std::vector<std::string> expected = {"--fifo",        dpx() + "/linux/sm3.fifo",
+                                             "--pid-file",    pid_files_.at("collector"),
+                                             "--format",      "apache-timed",
+                                             "--host",        "shop.example",
+                                             "--server-port", "443"};
+  EXPECT_EQ(expected, rest);
+  const Result status = Ctl("status", "");
+  EXPECT_NE(std::string::npos, status.output.find(", sm3logs)")) << status.output;
+  ASSERT_EQ(0, Ctl("stop", "collector").status);
+  EXPECT_FALSE(HasPidFile("collector"));
+
+  Configure("LOG_FORMAT='%h %^[%d:%t %^] \"%r\" %s %b %T'\nDATE_FORMAT=%d/%b/%Y\n");
+  ASSERT_EQ(0, Ctl("start", "collector").status);
+  const std::vector<std::string> custom = CaptureArgs("sm3logs");
+  const auto at = std::find(custom.begin(), custom.end(), "--log-format");
+  ASSERT_NE(at, custom.end());
+  EXPECT_EQ(*(at + 1), "%h %^[%d:%t %^] \"%r\" %s %b %T");
+  EXPECT_EQ(*(at + 2), "--date-format");
+  EXPECT_EQ(std::find(custom.begin(), custom.end(), "--format"), custom.end());
+  ASSERT_EQ(0, Ctl("stop", "collector").status);
+
+  Configure("LOG_PATH=\n");
+  const Result refused = Ctl("start", "collector");
+  EXPECT_EQ(1, refused.status);
+  EXPECT_NE(std::string::npos, refused.output.find("needs LOG_PATH")) << refused.output;
 }
 
 // Without FILTER the default web ports are captured; without SNAPLEN or CAPTURE_OPTIONS nothing

@@ -112,6 +112,8 @@ PageAssembler::Item PageAssembler::MakeItem(const HttpExchange& exchange) const 
   Item item;
   item.exchange = exchange;
   item.key = RequestKey(exchange);
+  item.hostless = exchange.request.host.empty() &&
+                  SplitTarget(exchange.request.target).host_from_target.empty();
   if (!exchange.request.referer.empty()) {
     item.referer_key = NormaliseUrl(exchange.request.referer);
   }
@@ -128,11 +130,16 @@ bool PageAssembler::Claims(const View& view, const Item& item) const {
   if (item.referer_key.empty() || item.exchange.start - view.page.exchange.start > kViewSpan) {
     return false;
   }
-  if (item.referer_key == view.page.key) {
-    return true;
-  }
-  return std::any_of(view.objects.begin(), view.objects.end(),
-                     [&item](const Item& object) { return object.key == item.referer_key; });
+  // A URL known without its host matches a Referer by what follows the Referer's host.
+  const std::string_view referer_path =
+      std::string_view(item.referer_key).substr(item.referer_key.find('/'));
+  const auto named = [&](const Item& target) {
+    if (!target.hostless) {
+      return target.key == item.referer_key;
+    }
+    return std::string_view(target.key).substr(target.key.find('/')) == referer_path;
+  };
+  return named(view.page) || std::any_of(view.objects.begin(), view.objects.end(), named);
 }
 
 void PageAssembler::Attach(View* view, Item&& item) {

@@ -55,6 +55,8 @@ class PageAssembler : public ExchangeSink {
     sm3gen::RecordKind kind = sm3gen::RecordKind::kObject;
     std::string key;          // its own URL, normalised
     std::string referer_key;  // its Referer, normalised; empty without one
+    bool hostless = false;    // its request named no host (an access log without one): its
+                              // URL is matched by path and query alone
   };
   struct View {
     Item page;

@@ -132,6 +132,20 @@ TEST_F(PageAssemblerTest, ObjectsThatEndBeforeTheirPageAreClaimedByIt) {
   EXPECT_EQ(stats_.orphan_objects, 0u);
 }
 
+// An access log without virtual hosts names no host: its pages match Referers by path.
+TEST_F(PageAssemblerTest, PagesWithoutAHostMatchByPath) {
+  const Micros t = 6000 * kSecond;
+  HttpExchange page = Exchange("/shop/index.html?a=1", "text/html", "", t, t + 10 * kMs);
+  page.request.host.clear();
+  HttpExchange css = Exchange("/s.css", "text/css", "https://www.example/shop/index.html?a=1",
+                              t + 20 * kMs, t + 30 * kMs);
+  css.request.host.clear();
+  Add(page);
+  Add(css);
+  pages_.Flush();
+  EXPECT_EQ(Written(), (Strings{"hpage /shop/index.html?a=1", "hobj /s.css"}));
+}
+
 TEST_F(PageAssemblerTest, ObjectsWithoutTheirPageBecomePagesOfTheirOwn) {
   const Micros t = 5000 * kSecond;
   // No Referer: a page at once (an API call, a download).
