@@ -257,21 +257,11 @@ int main(int argc, char** argv) {
 
   collector::InstallStopHandlers();
   capture::CaptureStats stats;
-  std::unique_ptr<capture::RecordOutput> output;
-  if (!out_path.empty()) {
-    auto file = std::make_unique<capture::FileOutput>(&stats);
-    if (!file->Open(out_path, &error)) {
-      std::fprintf(stderr, "sm3logs: %s\n", error.c_str());
-      return 1;
-    }
-    output = std::move(file);
-  } else {
-    auto fifo = std::make_unique<capture::FifoOutput>(&stats);
-    if (!fifo->Open(fifo_path, &error)) {
-      std::fprintf(stderr, "sm3logs: %s\n", error.c_str());
-      return 1;
-    }
-    output = std::move(fifo);
+  std::unique_ptr<capture::RecordOutput> output =
+      capture::OpenRecordOutput(out_path, fifo_path, &stats, &error);
+  if (output == nullptr) {
+    std::fprintf(stderr, "sm3logs: %s\n", error.c_str());
+    return 1;
   }
   const bool one_shot = !read_path.empty();
   follow.one_shot = one_shot;
@@ -304,12 +294,8 @@ int main(int argc, char** argv) {
     if (one_shot && follower.at_end()) {
       break;
     }
-    bool pumped = output->Pump(&error);
-    // Lines already written wait for the reader rather than be lost; a live log waits too.
-    while (pumped && output->Backlogged() && !collector::StopRequested()) {
-      output->WaitForRoom(std::chrono::milliseconds(100));
-      pumped = output->Pump(&error);
-    }
+    // Lines already read wait for the reader rather than be lost; a live log waits too.
+    const bool pumped = capture::PumpOutput(output.get(), /*wait=*/true, &error);
     if (!pumped) {
       std::fprintf(stderr, "sm3logs: %s\n", error.c_str());
       status = 1;

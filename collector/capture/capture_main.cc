@@ -153,21 +153,11 @@ int main(int argc, char** argv) {
   collector::InstallStopHandlers();
   std::string error;
   capture::CaptureStats stats;
-  std::unique_ptr<capture::RecordOutput> output;
-  if (!out_path.empty()) {
-    auto file = std::make_unique<capture::FileOutput>(&stats);
-    if (!file->Open(out_path, &error)) {
-      std::fprintf(stderr, "sm3capture: %s\n", error.c_str());
-      return 1;
-    }
-    output = std::move(file);
-  } else {
-    auto fifo = std::make_unique<capture::FifoOutput>(&stats);
-    if (!fifo->Open(fifo_path, &error)) {
-      std::fprintf(stderr, "sm3capture: %s\n", error.c_str());
-      return 1;
-    }
-    output = std::move(fifo);
+  std::unique_ptr<capture::RecordOutput> output =
+      capture::OpenRecordOutput(out_path, fifo_path, &stats, &error);
+  if (output == nullptr) {
+    std::fprintf(stderr, "sm3capture: %s\n", error.c_str());
+    return 1;
   }
   capture::PcapSource pcap;
   if (!pcap.Open(source, &error)) {
@@ -224,13 +214,9 @@ int main(int argc, char** argv) {
         PrintStats("stats: ", stats);
       }
     }
-    bool pumped = output->Pump(&error);
     // A file is read faster than any writer takes records: wait for the reader rather than
     // lose them. Live traffic cannot wait, so there the queue's limit counts them lost.
-    while (pumped && !pcap.live() && output->Backlogged() && !collector::StopRequested()) {
-      output->WaitForRoom(std::chrono::milliseconds(100));
-      pumped = output->Pump(&error);
-    }
+    const bool pumped = capture::PumpOutput(output.get(), !pcap.live(), &error);
     if (!pumped) {
       std::fprintf(stderr, "sm3capture: %s\n", error.c_str());
       status = 1;

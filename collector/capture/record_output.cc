@@ -172,12 +172,7 @@ bool FifoOutput::Finish(std::chrono::steady_clock::time_point deadline, std::str
       return false;
     }
     if (sent_ < bytes_.size()) {
-      if (fd_.valid()) {
-        struct pollfd pfd = {fd_.get(), POLLOUT, 0};
-        ::poll(&pfd, 1, 10);
-      } else {
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-      }
+      WaitForRoom(std::chrono::milliseconds(10));
     }
   }
   // What the reader never took is lost; a record it had begun is finished or dropped by it.
@@ -185,6 +180,26 @@ bool FifoOutput::Finish(std::chrono::steady_clock::time_point deadline, std::str
   stats_->records_lost += unsent;
   stats_->records -= unsent;
   return true;
+}
+
+std::unique_ptr<RecordOutput> OpenRecordOutput(const std::string& out_path,
+                                               const std::string& fifo_path, CaptureStats* stats,
+                                               std::string* error) {
+  if (!out_path.empty()) {
+    auto file = std::make_unique<FileOutput>(stats);
+    return file->Open(out_path, error) ? std::move(file) : nullptr;
+  }
+  auto fifo = std::make_unique<FifoOutput>(stats);
+  return fifo->Open(fifo_path, error) ? std::move(fifo) : nullptr;
+}
+
+bool PumpOutput(RecordOutput* output, bool wait, std::string* error) {
+  bool pumped = output->Pump(error);
+  while (pumped && wait && output->Backlogged() && !collector::StopRequested()) {
+    output->WaitForRoom(std::chrono::milliseconds(100));
+    pumped = output->Pump(error);
+  }
+  return pumped;
 }
 
 }  // namespace capture

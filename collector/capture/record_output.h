@@ -14,6 +14,7 @@
 #include <chrono>
 #include <cstdint>
 #include <deque>
+#include <memory>
 #include <string>
 
 #include "collector/capture/capture_stats.h"
@@ -88,5 +89,16 @@ class FifoOutput : public RecordOutput {
   std::deque<size_t> ends_;  // offset in bytes_ just past each queued record
   std::chrono::steady_clock::time_point next_connect_{};
 };
+
+// The output a collector program was asked for: a file (out_path, "-" for standard output) or
+// the writer's FIFO (fifo_path); exactly one is non-empty. nullptr with *error when it cannot be
+// opened. stats must outlive the output.
+std::unique_ptr<RecordOutput> OpenRecordOutput(const std::string& out_path,
+                                               const std::string& fifo_path, CaptureStats* stats,
+                                               std::string* error);
+
+// Pump, then, when the producer can wait (wait), keep pumping while the output is backlogged
+// and no stop was requested. False with *error when the output failed.
+bool PumpOutput(RecordOutput* output, bool wait, std::string* error);
 
 }  // namespace capture
