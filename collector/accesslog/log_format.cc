@@ -5,10 +5,10 @@
 #include <algorithm>
 #include <array>
 #include <cstring>
-#include <ctime>
 #include <iterator>
-#include <limits>
 #include <utility>
+
+#include "collector/accesslog/text_reading.h"
 
 namespace accesslog {
 
@@ -21,30 +21,7 @@ struct LogFormat::Cursor {
   size_t left() const { return static_cast<size_t>(end - p); }
 };
 
-struct LogFormat::TimeParts {
-  int year = -1;
-  int month = 0;  // 1..12
-  int day = 0;    // 1..31
-  int hour = 0;
-  int minute = 0;
-  int second = 0;
-  int64_t fraction_us = 0;
-  bool has_zone = false;
-  int zone_seconds = 0;  // east of UTC
-  bool has_epoch = false;
-  int64_t epoch_us = 0;
-};
-
 namespace {
-
-enum class Number { kOk, kNotNumber, kOutOfRange };
-
-bool IsDigit(char c) {
-  return c >= '0' && c <= '9';
-}
-bool IsBlank(char c) {
-  return c == ' ' || c == '\t';
-}
 
 int HexValue(char c) {
   if (IsDigit(c)) {
@@ -57,91 +34,6 @@ int HexValue(char c) {
     return c - 'A' + 10;
   }
   return -1;
-}
-
-// A character shown in a reason: printable as itself, anything else as \xHH.
-std::string Shown(char c) {
-  const auto u = static_cast<unsigned char>(c);
-  if (u >= 0x20 && u < 0x7f) {
-    return std::string(1, c);
-  }
-  return fmt::format("\\x{:02x}", u);
-}
-
-bool Fail(std::string* reason, std::string text) {
-  if (reason != nullptr) {
-    *reason = std::move(text);
-  }
-  return false;
-}
-
-Number ParseUnsigned(std::string_view text, uint64_t max, uint64_t* out) {
-  if (text.empty()) {
-    return Number::kNotNumber;
-  }
-  uint64_t value = 0;
-  for (char c : text) {
-    if (!IsDigit(c)) {
-      return Number::kNotNumber;
-    }
-    const uint64_t digit = static_cast<uint64_t>(c - '0');
-    if (value > (max - digit) / 10) {
-      return Number::kOutOfRange;
-    }
-    value = value * 10 + digit;
-  }
-  *out = value;
-  return Number::kOk;
-}
-
-// "I" or "I.F" in some unit, as an integer count of 10^-scale of that unit. Fraction digits
-// beyond the scale are dropped.
-Number ParseDecimal(std::string_view text, int scale, int64_t* out) {
-  const size_t dot = text.find('.');
-  const std::string_view whole = text.substr(0, dot);
-  uint64_t value = 0;
-  constexpr uint64_t kMax = static_cast<uint64_t>(std::numeric_limits<int64_t>::max());
-  const Number n = ParseUnsigned(whole, kMax, &value);
-  if (n != Number::kOk) {
-    return n;
-  }
-  std::string_view fraction;
-  if (dot != std::string_view::npos) {
-    fraction = text.substr(dot + 1);
-    if (fraction.empty()) {
-      return Number::kNotNumber;
-    }
-  }
-  for (int i = 0; i < scale; ++i) {
-    if (value > kMax / 10) {
-      return Number::kOutOfRange;
-    }
-    value *= 10;
-  }
-  uint64_t part = 0;
-  uint64_t unit = 1;
-  for (int i = scale - 1; i > 0; --i) {
-    unit *= 10;
-  }
-  for (size_t i = 0; i < fraction.size(); ++i) {
-    if (!IsDigit(fraction[i])) {
-      return Number::kNotNumber;
-    }
-    if (static_cast<int>(i) < scale) {
-      part += static_cast<uint64_t>(fraction[i] - '0') * unit;
-      unit /= 10;
-    }
-  }
-  if (value > kMax - part) {
-    return Number::kOutOfRange;
-  }
-  *out = static_cast<int64_t>(value + part);
-  return Number::kOk;
-}
-
-bool NumberFail(Number n, std::string_view name, std::string* reason) {
-  return Fail(reason, n == Number::kNotNumber ? fmt::format("{} is not a number", name)
-                                              : fmt::format("{} out of range", name));
 }
 
 // The closing quote of a quoted field: a '"' not escaped by an odd run of backslashes, as
@@ -307,170 +199,10 @@ bool ParseUpstream(const char*& p, const char* end, int64_t* sum_us, std::string
   return true;
 }
 
-constexpr std::array<std::string_view, 12> kMonthNames = {
-    "january", "february", "march",     "april",   "may",      "june",
-    "july",    "august",   "september", "october", "november", "december"};
-
-char Lower(char c) {
-  return (c >= 'A' && c <= 'Z') ? static_cast<char>(c - 'A' + 'a') : c;
-}
-
-// A month name, abbreviated ("Oct") or full ("October"), any case; 0 if there is none.
-int ReadMonthName(const char*& p, const char* end) {
-  if (end - p < 3) {
-    return 0;
-  }
-  for (size_t m = 0; m < kMonthNames.size(); ++m) {
-    const std::string_view name = kMonthNames[m];
-    if (Lower(p[0]) != name[0] || Lower(p[1]) != name[1] || Lower(p[2]) != name[2]) {
-      continue;
-    }
-    size_t length = 3;
-    while (length < name.size() && static_cast<size_t>(end - p) > length &&
-           Lower(p[length]) == name[length]) {
-      ++length;
-    }
-    p += (length == name.size()) ? length : 3;
-    return static_cast<int>(m) + 1;
-  }
-  return 0;
-}
-
-bool ReadDigits(const char*& p, const char* end, int min_digits, int max_digits, int* value) {
-  int digits = 0;
-  int v = 0;
-  while (digits < max_digits && p < end && IsDigit(*p)) {
-    v = v * 10 + (*p - '0');
-    ++p;
-    ++digits;
-  }
-  *value = v;
-  return digits >= min_digits;
-}
-
-bool ReadZone(const char*& p, const char* end, int* seconds) {
-  if (p < end && (*p == 'Z' || *p == 'z')) {
-    ++p;
-    *seconds = 0;
-    return true;
-  }
-  if (p == end || (*p != '+' && *p != '-')) {
-    return false;
-  }
-  const int sign = (*p == '-') ? -1 : 1;
-  ++p;
-  int hours = 0;
-  int minutes = 0;
-  if (!ReadDigits(p, end, 2, 2, &hours)) {
-    return false;
-  }
-  if (p < end && *p == ':') {
-    ++p;
-  }
-  if (!ReadDigits(p, end, 2, 2, &minutes) || hours > 23 || minutes > 59) {
-    return false;
-  }
-  *seconds = sign * (hours * 3600 + minutes * 60);
-  return true;
-}
-
-bool IsLeapYear(int y) {
-  return (y % 4 == 0 && y % 100 != 0) || y % 400 == 0;
-}
-
-int DaysInMonth(int year, int month) {
-  static constexpr std::array<int, 12> kDays = {31, 28, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
-  return (month == 2 && IsLeapYear(year)) ? 29 : kDays[static_cast<size_t>(month - 1)];
-}
-
-// Days from 1970-01-01 to a proleptic Gregorian date (Howard Hinnant's days_from_civil).
-int64_t DaysFromCivil(int64_t y, int m, int d) {
-  y -= (m <= 2) ? 1 : 0;
-  const int64_t era = (y >= 0 ? y : y - 399) / 400;
-  const int64_t yoe = y - era * 400;
-  const int64_t doy = (153 * (m > 2 ? m - 3 : m + 9) + 2) / 5 + d - 1;
-  const int64_t doe = yoe * 365 + yoe / 4 - yoe / 100 + doy;
-  return era * 146097 + doe - 719468;
-}
-
 constexpr std::array<std::string_view, 5> kPresetNames = {
     "combined", "nginx-timed", "nginx-timed-vhost", "apache-timed", "apache-timed-vhost"};
 
 }  // namespace
-
-bool LogFormat::ToMicros(const TimeParts& t, int64_t* out, std::string* reason) {
-  if (t.has_epoch) {
-    *out = t.epoch_us;
-    return true;
-  }
-  if (t.day > DaysInMonth(t.year, t.month)) {
-    return Fail(reason, "date has no such day");
-  }
-  int64_t seconds = 0;
-  if (t.has_zone) {
-    seconds = DaysFromCivil(t.year, t.month, t.day) * 86400 + t.hour * 3600 + t.minute * 60 +
-              t.second - t.zone_seconds;
-  } else {
-    // Without a logged zone the stamp is in the zone the server ran in: take ours.
-    std::tm tm{};
-    tm.tm_year = t.year - 1900;
-    tm.tm_mon = t.month - 1;
-    tm.tm_mday = t.day;
-    tm.tm_hour = t.hour;
-    tm.tm_min = t.minute;
-    tm.tm_sec = t.second;
-    tm.tm_isdst = -1;
-    const std::time_t local = std::mktime(&tm);
-    if (local == static_cast<std::time_t>(-1) && tm.tm_year != 69) {
-      return Fail(reason, "local time out of range");
-    }
-    seconds = static_cast<int64_t>(local);
-  }
-  *out = seconds * 1000000 + t.fraction_us;
-  return true;
-}
-
-bool LogFormat::CompileTimeFormat(std::string_view format, std::string_view what,
-                                  std::vector<TimeStep>* steps, std::string* error) {
-  auto add = [steps](TimeKind kind, char literal = 0) { steps->push_back({kind, literal}); };
-  for (size_t i = 0; i < format.size(); ++i) {
-    const char c = format[i];
-    if (c != '%') {
-      add(IsBlank(c) ? TimeKind::kBlanks : TimeKind::kLiteral, c);
-      continue;
-    }
-    if (++i == format.size()) {
-      return Fail(error, fmt::format("{} format ends with '%'", what));
-    }
-    static constexpr std::pair<char, TimeKind> kSimple[] = {
-        {'Y', TimeKind::kYear4},        {'y', TimeKind::kYear2},      {'m', TimeKind::kMonth},
-        {'b', TimeKind::kMonthName},    {'B', TimeKind::kMonthName},  {'h', TimeKind::kMonthName},
-        {'d', TimeKind::kDay},          {'e', TimeKind::kDayBlank},   {'H', TimeKind::kHour},
-        {'M', TimeKind::kMinute},       {'S', TimeKind::kSecond},     {'z', TimeKind::kZone},
-        {'s', TimeKind::kEpochSeconds}, {'f', TimeKind::kEpochMicros}};
-    static constexpr std::pair<char, std::string_view> kShorthands[] = {
-        {'T', "%H:%M:%S"}, {'R', "%H:%M"}, {'F', "%Y-%m-%d"}, {'D', "%m/%d/%y"}};
-    const auto is = [&format, i](const auto& entry) { return entry.first == format[i]; };
-    if (const auto* simple = std::find_if(std::begin(kSimple), std::end(kSimple), is);
-        simple != std::end(kSimple)) {
-      add(simple->second);
-      continue;
-    }
-    if (const auto* shorthand = std::find_if(std::begin(kShorthands), std::end(kShorthands), is);
-        shorthand != std::end(kShorthands)) {
-      CompileTimeFormat(shorthand->second, what, steps, error);
-      continue;
-    }
-    switch (format[i]) {
-      case '%':
-        add(TimeKind::kLiteral, '%');
-        break;
-      default:
-        return Fail(error, fmt::format("{} format: unsupported %{}", what, Shown(format[i])));
-    }
-  }
-  return true;
-}
 
 bool LogFormat::CompileSpecifier(std::string_view log_format, size_t* i, Kind* kind,
                                  std::string* error) {
@@ -550,28 +282,16 @@ bool LogFormat::ResolveDelimiters(std::string* error) {
 
 bool LogFormat::CompileTimeFormats(std::string_view date_format, std::string_view time_format,
                                    std::string* error) {
-  if (!CompileTimeFormat(date_format, "date", &date_steps_, error) ||
-      !CompileTimeFormat(time_format, "time", &time_steps_, error)) {
+  std::optional<TimeFormat> date = TimeFormat::Compile(date_format, "date", error);
+  std::optional<TimeFormat> time = TimeFormat::Compile(time_format, "time", error);
+  if (!date || !time) {
     return false;
   }
-  date_time_steps_ = date_steps_;
-  if (date_format != time_format) {
-    date_time_steps_.push_back({TimeKind::kBlanks, ' '});
-    date_time_steps_.insert(date_time_steps_.end(), time_steps_.begin(), time_steps_.end());
-  }
+  date_ = std::move(*date);
+  time_ = std::move(*time);
+  date_time_ = TimeFormat::Joined(date_, time_, date_format == time_format);
   // Every format must give a whole date, or seconds since 1970.
-  bool year = false;
-  bool month = false;
-  bool day = false;
-  for (const TimeStep& t : date_time_steps_) {
-    year |= t.kind == TimeKind::kYear4 || t.kind == TimeKind::kYear2;
-    month |= t.kind == TimeKind::kMonth || t.kind == TimeKind::kMonthName;
-    day |= t.kind == TimeKind::kDay || t.kind == TimeKind::kDayBlank;
-    if (t.kind == TimeKind::kEpochSeconds || t.kind == TimeKind::kEpochMicros) {
-      year = month = day = true;
-    }
-  }
-  return (year && month && day) ||
+  return date_time_.HasWholeDate() ||
          Fail(error, "date format needs a year, a month and a day (or %s or %f)");
 }
 
@@ -631,101 +351,6 @@ std::optional<LogFormat> LogFormat::Preset(std::string_view name, std::string* e
 
 std::span<const std::string_view> LogFormat::PresetNames() {
   return kPresetNames;
-}
-
-bool LogFormat::ParseTimeSteps(const std::vector<TimeStep>& steps, Cursor* cursor, TimeParts* t,
-                               std::string* reason) {
-  const char*& p = cursor->p;
-  const char* end = cursor->end;
-  for (const TimeStep& step : steps) {
-    const size_t column = cursor->column();
-    int value = 0;
-    auto number = [&](int min_digits, int max_digits, int low, int high, std::string_view name,
-                      int* out) {
-      if (!ReadDigits(p, end, min_digits, max_digits, &value)) {
-        return Fail(reason, fmt::format("expected {} at column {}", name, column));
-      }
-      if (value < low || value > high) {
-        return Fail(reason, fmt::format("{} out of range at column {}", name, column));
-      }
-      *out = value;
-      return true;
-    };
-    bool ok = true;
-    switch (step.kind) {
-      case TimeKind::kLiteral:
-        if (p == end || *p != step.literal) {
-          return Fail(reason,
-                      fmt::format("expected '{}' at column {}", Shown(step.literal), column));
-        }
-        ++p;
-        break;
-      case TimeKind::kBlanks:
-        while (p < end && IsBlank(*p)) {
-          ++p;
-        }
-        break;
-      case TimeKind::kYear4:
-        ok = number(4, 4, 0, 9999, "year", &t->year);
-        break;
-      case TimeKind::kYear2:
-        ok = number(2, 2, 0, 99, "year", &t->year);
-        t->year += t->year < 69 ? 2000 : 1900;
-        break;
-      case TimeKind::kMonth:
-        ok = number(1, 2, 1, 12, "month", &t->month);
-        break;
-      case TimeKind::kMonthName:
-        t->month = ReadMonthName(p, end);
-        if (t->month == 0) {
-          return Fail(reason, fmt::format("bad month name at column {}", column));
-        }
-        break;
-      case TimeKind::kDayBlank:
-        if (p < end && *p == ' ') {
-          ++p;
-        }
-        ok = number(1, 2, 1, 31, "day", &t->day);
-        break;
-      case TimeKind::kDay:
-        ok = number(1, 2, 1, 31, "day", &t->day);
-        break;
-      case TimeKind::kHour:
-        ok = number(1, 2, 0, 23, "hour", &t->hour);
-        break;
-      case TimeKind::kMinute:
-        ok = number(1, 2, 0, 59, "minute", &t->minute);
-        break;
-      case TimeKind::kSecond:
-        ok = number(1, 2, 0, 60, "second", &t->second);
-        break;
-      case TimeKind::kZone:
-        if (!ReadZone(p, end, &t->zone_seconds)) {
-          return Fail(reason, fmt::format("bad zone offset at column {}", column));
-        }
-        t->has_zone = true;
-        break;
-      case TimeKind::kEpochSeconds:
-      case TimeKind::kEpochMicros: {
-        const bool seconds = step.kind == TimeKind::kEpochSeconds;
-        const char* start = p;
-        while (p < end && (IsDigit(*p) || (seconds && *p == '.'))) {
-          ++p;
-        }
-        const Number n = ParseDecimal(std::string_view(start, static_cast<size_t>(p - start)),
-                                      seconds ? 6 : 0, &t->epoch_us);
-        if (n != Number::kOk) {
-          return NumberFail(n, fmt::format("time stamp at column {}", column), reason);
-        }
-        t->has_epoch = true;
-        break;
-      }
-    }
-    if (!ok) {
-      return false;
-    }
-  }
-  return true;
 }
 
 bool LogFormat::StoreField(Kind kind, std::string_view text, LogEntry* entry, std::string* reason) {
@@ -901,13 +526,13 @@ bool LogFormat::Parse(std::string_view line, LogEntry* entry, std::string* reaso
         ok = ParseUpstream(cursor.p, cursor.end, &entry->upstream_time_us, reason);
         break;
       case Kind::kDate:
-        ok = ParseTimeSteps(date_steps_, &cursor, &time, reason);
+        ok = date_.Read(cursor.begin, cursor.p, cursor.end, &time, reason);
         break;
       case Kind::kTime:
-        ok = ParseTimeSteps(time_steps_, &cursor, &time, reason);
+        ok = time_.Read(cursor.begin, cursor.p, cursor.end, &time, reason);
         break;
       case Kind::kDateTime:
-        ok = ParseTimeSteps(date_time_steps_, &cursor, &time, reason);
+        ok = date_time_.Read(cursor.begin, cursor.p, cursor.end, &time, reason);
         break;
       case Kind::kZone:
         ok = ReadZone(cursor.p, cursor.end, &time.zone_seconds) ||

@@ -26,11 +26,8 @@
 //      "0.010 : 0.020", whose values are added up
 // %U and %q together build the target; %q must come after %U.
 //
-// Date and time formats: %Y %y %m %d %e %b (Jan..Dec; full names too) %H %M %S %z %T %F %D %R,
-// %s (seconds since 1970, fraction allowed), %f (microseconds since 1970), %% and literal
-// characters; a blank matches any run of blanks. %d, %t, %x and %z are read by their own syntax
-// rather than up to a delimiter. A time stamp without a zone is local time (mktime; set TZ, or
-// glibc reads /etc/localtime for every line).
+// Date and time formats: see time_format.h. %d, %t, %x and %z are read by their own syntax rather
+// than up to a delimiter. A time stamp without a zone is this host's local time.
 //
 // Quoted fields (a field that ends at '"') may hold quotes escaped as \" (Apache) or \x22
 // (nginx). %R, %u and the request target are unescaped (\" \\ \xHH); other fields are kept
@@ -46,6 +43,8 @@
 #include <string>
 #include <string_view>
 #include <vector>
+
+#include "collector/accesslog/time_format.h"
 
 namespace accesslog {
 
@@ -157,31 +156,7 @@ class LogFormat {
     std::string literal;  // kLiteral only
   };
 
-  // One element of a date or time format.
-  enum class TimeKind : uint8_t {
-    kLiteral,
-    kBlanks,
-    kYear4,
-    kYear2,
-    kMonth,
-    kMonthName,
-    kDay,
-    kDayBlank,
-    kHour,
-    kMinute,
-    kSecond,
-    kZone,
-    kEpochSeconds,
-    kEpochMicros,
-  };
-
-  struct TimeStep {
-    TimeKind kind = TimeKind::kLiteral;
-    char literal = 0;
-  };
-
-  struct Cursor;     // the line and the read position
-  struct TimeParts;  // the date and time read so far from a line
+  struct Cursor;  // the line and the read position
 
   LogFormat() = default;
 
@@ -192,18 +167,13 @@ class LogFormat {
   bool ResolveDelimiters(std::string* error);
   bool CompileTimeFormats(std::string_view date_format, std::string_view time_format,
                           std::string* error);
-  static bool CompileTimeFormat(std::string_view format, std::string_view what,
-                                std::vector<TimeStep>* steps, std::string* error);
   bool ParseField(const Step& step, Cursor* cursor, LogEntry* entry, std::string* reason) const;
   static bool StoreField(Kind kind, std::string_view text, LogEntry* entry, std::string* reason);
-  static bool ToMicros(const TimeParts& parts, int64_t* micros, std::string* reason);
-  static bool ParseTimeSteps(const std::vector<TimeStep>& steps, Cursor* cursor, TimeParts* parts,
-                             std::string* reason);
 
   std::vector<Step> steps_;
-  std::vector<TimeStep> date_steps_;
-  std::vector<TimeStep> time_steps_;
-  std::vector<TimeStep> date_time_steps_;  // for %x
+  TimeFormat date_;
+  TimeFormat time_;
+  TimeFormat date_time_;  // for %x
   bool time_is_start_ = false;
 };
 

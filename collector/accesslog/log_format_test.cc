@@ -253,6 +253,22 @@ TEST_F(TimeStampTest, LocalTimeWithoutZone) {
   EXPECT_EQ(entry_.time_us, kOct10);
 }
 
+// Local stamps across a change to summer time, each minute on its own: 01:59:59 CET and
+// 03:00:00 CEST are one second apart.
+TEST_F(TimeStampTest, LocalTimeAcrossDaylightSaving) {
+  const ScopedTimeZone zone("CET-1CEST,M3.5.0,M10.5.0/3");
+  UseFormat("%h [%d:%t]", "%d/%b/%Y", "%H:%M:%S");
+  constexpr int64_t kSecond = 1000000;
+  ASSERT_TRUE(Ok("1.2.3.4 [29/Mar/2026:01:59:30]"));
+  EXPECT_EQ(entry_.time_us, 1774745970 * kSecond);
+  ASSERT_TRUE(Ok("1.2.3.4 [29/Mar/2026:01:59:59]"));
+  EXPECT_EQ(entry_.time_us, 1774745999 * kSecond);
+  ASSERT_TRUE(Ok("1.2.3.4 [29/Mar/2026:03:00:00]"));
+  EXPECT_EQ(entry_.time_us, 1774746000 * kSecond);
+  ASSERT_TRUE(Ok("1.2.3.4 [29/Mar/2026:01:59:59]"));  // back to a minute seen before
+  EXPECT_EQ(entry_.time_us, 1774745999 * kSecond);
+}
+
 // Seconds since 1970 with a fraction ($msec), ISO 8601 with "+02:00", and microseconds (%f).
 TEST_F(TimeStampTest, OtherStampShapes) {
   UseFormat("%x %h", "%s", "%s");
