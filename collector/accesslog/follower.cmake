@@ -1,5 +1,5 @@
 # The log follower: reads an access log across rotation and truncation, with its offset state.
-add_library(accesslog_follow STATIC log_follower.cc follow_state.cc)
+add_library(accesslog_follow STATIC log_follower.cc follow_state.cc commit_points.cc)
 q7_target_options(accesslog_follow)
 target_link_libraries(accesslog_follow PUBLIC collector_common PRIVATE fmt::fmt)
 

@@ -98,6 +98,7 @@ void ToExchange(const LogEntry& entry, const ServerSide& server, capture::HttpEx
   request.method = entry.method;
   request.target = entry.target;
   request.host = entry.vhost.empty() ? server.host : entry.vhost;
+  e->host_assumed = entry.vhost.empty();
   request.referer = entry.referer;
   request.user_agent = entry.user_agent;
   request.version_minor = VersionMinor(entry.protocol);

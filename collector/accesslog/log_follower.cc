@@ -467,20 +467,23 @@ void LogFollower::FlushTail(const LineFn& on_line) {
 }
 
 bool LogFollower::Commit(std::string* error) {
-  if (options_.state_path.empty() || options_.one_shot || !fd_.valid()) {
+  if (!fd_.valid()) {
     return true;
   }
-  if (!UpdateHead(error)) {
-    return false;
-  }
-  const FilePosition now = position();
-  if (saved_once_ && now == last_saved_) {
+  return UpdateHead(error) && CommitAt(position(), error);
+}
+
+bool LogFollower::CommitAt(const FilePosition& at, std::string* error) {
+  if (options_.state_path.empty() || options_.one_shot || at.ino == 0) {
     return true;
   }
-  if (!SaveFollowState(options_.state_path, FollowState{path_, now}, error)) {
+  if (saved_once_ && at == last_saved_) {
+    return true;
+  }
+  if (!SaveFollowState(options_.state_path, FollowState{path_, at}, error)) {
     return false;
   }
-  last_saved_ = now;
+  last_saved_ = at;
   saved_once_ = true;
   ++stats_.commits;
   return true;

@@ -112,6 +112,9 @@ class LogFollower {
   // after a restart. Does nothing without a state path, while no file is open, or when the
   // position did not move. False with *error when the state file cannot be written.
   bool Commit(std::string* error);
+  // Saves an earlier position() of this follower (one whose lines have all been consumed while
+  // later ones have not). The same no-ops as Commit; at.ino == 0 (no file was open) too.
+  bool CommitAt(const FilePosition& at, std::string* error);
 
   // Non-fatal events worth a trace line (a state file set aside, where a restart resumed, a
   // rotation or truncation followed), oldest first; clears them.

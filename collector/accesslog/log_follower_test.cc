@@ -11,6 +11,7 @@
 #include <fstream>
 #include <memory>
 
+#include "collector/accesslog/commit_points.h"
 #include "tests/support/scratch_dir.h"
 
 namespace accesslog {
@@ -216,6 +217,44 @@ TEST_F(LogFollowerTest, RestartResumesAfterTheLastCommittedLine) {
 
   auto third = Start(Options(/*from_start=*/false));
   EXPECT_EQ(Poll(third.get()), Lines({"4", "5"}));
+}
+
+// Saving while lines are still held: the position after the last line whose record is out,
+// even when the log was rotated since. A crash then repeats the held lines, skips none.
+TEST_F(LogFollowerTest, CommitPointBeforeHeldLinesSurvivesRotation) {
+  Append(Log(), "1\n2\n");
+  auto first = Start(Options());
+  CommitPoints points;
+  uint64_t lines = 0;
+  const auto poll = [&] {
+    const Lines got = Poll(first.get());
+    lines += got.size();
+    points.Reached(lines, first->position());
+    return got;
+  };
+  poll();
+  Append(Log(), "3\n");
+  poll();
+  std::filesystem::rename(Log(), Log() + ".1");
+  Append(Log(), "4\n");
+  EXPECT_EQ(poll(), Lines({"4"}));
+  EXPECT_EQ(points.size(), 3u);
+
+  EXPECT_FALSE(points.TakeSafe(1).has_value());                 // line 1 held: nothing is safe
+  const std::optional<FilePosition> safe = points.TakeSafe(3);  // lines 1-2 out, 3 held
+  ASSERT_TRUE(safe.has_value());
+  EXPECT_EQ(safe->offset, 4u);
+  std::string error;
+  ASSERT_TRUE(first->CommitAt(*safe, &error)) << error;
+  first.reset();  // a crash: lines 3 and 4 never reached the output
+
+  auto second = Start(Options(/*from_start=*/false));
+  EXPECT_EQ(Poll(second.get()), Lines({"3", "4"}));
+  // Once nothing is held, the latest point is the one to save.
+  CommitPoints more;
+  more.Reached(1, second->position());
+  EXPECT_EQ(more.TakeSafe(UINT64_MAX), second->position());
+  EXPECT_EQ(more.size(), 0u);
 }
 
 // Rotated while stopped: the rest of ".1" from the saved offset, then the new file.

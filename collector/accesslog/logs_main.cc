@@ -14,9 +14,11 @@
 #include <cstdio>
 #include <cstring>
 #include <memory>
+#include <optional>
 #include <string>
 #include <thread>
 
+#include "collector/accesslog/commit_points.h"
 #include "collector/accesslog/log_exchange.h"
 #include "collector/accesslog/log_follower.h"
 #include "collector/accesslog/log_format.h"
@@ -36,7 +38,8 @@ Formats (--format): combined (nginx and Apache's default; time stamp = end of re
 Sources: --read FILE reads one file to its end; --follow FILE tails a live log across rename
   rotation and copytruncate, keeping its position in --state, so a restart neither skips nor
   repeats a line (without a state it starts at the end of the log, or at its start with
-  --from-start).
+  --from-start). The position is also saved every second up to the last line whose record is
+  out, so after a crash only the lines of that second and of views still open are read again.
 Records: total response time = the logged request time; server time = the upstream time
   where logged, else the request time; network = the rest. Pages and objects by the URL's
   extension (.css .js .png ... are objects), objects after their page when their Referer names
@@ -47,6 +50,9 @@ Exit status: 0 done (also after SIGINT or SIGTERM), 1 the input or output cannot
 
 constexpr int kUsageError = 2;
 constexpr int kQuotedBadLines = 5;
+// How often a followed log's position is saved while running: what a crash repeats at most,
+// beyond the lines still held in open views.
+constexpr std::chrono::seconds kCommitInterval(1);
 
 using Clock = std::chrono::steady_clock;
 
@@ -131,10 +137,13 @@ class LogPipeline {
       return;
     }
     accesslog::ToExchange(entry_, server_, &exchange_);
+    exchange_.sequence = lines_;
     pages_.OnExchange(exchange_);
   }
   void Advance(capture::Micros now) { pages_.Advance(now); }
   void Flush() { pages_.Flush(); }
+  // The number of the oldest line whose record is still held in a view; UINT64_MAX: none.
+  uint64_t OldestHeld() const { return pages_.OldestHeld(); }
   uint64_t lines() const { return lines_; }
   uint64_t bad() const { return bad_; }
 
@@ -280,6 +289,10 @@ int main(int argc, char** argv) {
 
   int status = 0;
   Clock::time_point next_stats = Clock::now() + std::chrono::seconds(stats_seconds);
+  // While following, the position is saved every second up to the last line whose record has
+  // left the process, so that a crash repeats little and skips nothing.
+  accesslog::CommitPoints commit_points;
+  Clock::time_point next_commit = Clock::now() + kCommitInterval;
   while (!collector::StopRequested()) {
     if (!follower.Poll(on_line, &error)) {
       std::fprintf(stderr, "sm3logs: %s\n", error.c_str());
@@ -287,6 +300,9 @@ int main(int argc, char** argv) {
         status = 1;
         break;
       }
+    }
+    if (!one_shot) {
+      commit_points.Reached(logs.lines(), follower.position());
     }
     for (const std::string& note : follower.TakeNotes()) {
       std::fprintf(stderr, "sm3logs: %s\n", note.c_str());
@@ -303,6 +319,14 @@ int main(int argc, char** argv) {
     }
     if (!one_shot) {
       logs.Advance(WallMicros());
+      if (Clock::now() >= next_commit && output->Drained()) {
+        next_commit = Clock::now() + kCommitInterval;
+        const std::optional<accesslog::FilePosition> safe =
+            commit_points.TakeSafe(logs.OldestHeld());
+        if (safe && !follower.CommitAt(*safe, &error)) {
+          std::fprintf(stderr, "sm3logs: %s\n", error.c_str());
+        }
+      }
       if (stats_seconds > 0 && Clock::now() >= next_stats) {
         next_stats = Clock::now() + std::chrono::seconds(stats_seconds);
         PrintStats("stats: ", logs, stats, follower.stats());

@@ -37,6 +37,14 @@ struct HttpExchange {
   uint32_t request_acks = 0;   // the server's, from the request's first byte until the reply
   uint32_t response_acks = 0;  // the client's, while the reply was received
   bool gap = false;            // bytes of it were missing from the capture
+
+  // request.host was not seen but assumed (an access log without virtual hosts names its site
+  // by --host): Referers then match this request's URL by path and query alone, as a site
+  // reached under several names is referred to by any of them.
+  bool host_assumed = false;
+
+  // The producer's own order number (sm3logs: the log line's), for PageAssembler::OldestHeld.
+  uint64_t sequence = 0;
 };
 
 // Receives finished exchanges, in the order their replies ended.

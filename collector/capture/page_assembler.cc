@@ -112,8 +112,9 @@ PageAssembler::Item PageAssembler::MakeItem(const HttpExchange& exchange) const 
   Item item;
   item.exchange = exchange;
   item.key = RequestKey(exchange);
-  item.hostless = exchange.request.host.empty() &&
-                  SplitTarget(exchange.request.target).host_from_target.empty();
+  item.hostless =
+      exchange.host_assumed || (exchange.request.host.empty() &&
+                                SplitTarget(exchange.request.target).host_from_target.empty());
   if (!exchange.request.referer.empty()) {
     item.referer_key = NormaliseUrl(exchange.request.referer);
   }
@@ -243,6 +244,23 @@ void PageAssembler::Flush() {
     }
   }
   clients_.clear();
+}
+
+uint64_t PageAssembler::OldestHeld() const {
+  uint64_t oldest = UINT64_MAX;
+  for (const auto& entry : clients_) {
+    const Client& client = entry.second;
+    if (client.has_view) {
+      oldest = std::min(oldest, client.view.page.exchange.sequence);
+      for (const Item& object : client.view.objects) {
+        oldest = std::min(oldest, object.exchange.sequence);
+      }
+    }
+    for (const Item& item : client.waiting) {
+      oldest = std::min(oldest, item.exchange.sequence);
+    }
+  }
+  return oldest;
 }
 
 void PageAssembler::WriteView(Client* client) {

@@ -48,6 +48,10 @@ class PageAssembler : public ExchangeSink {
   void Advance(Micros now);
   // Writes everything still open (end of input).
   void Flush();
+  // The smallest HttpExchange::sequence among the exchanges not written yet; UINT64_MAX when
+  // none is held. Every exchange with a smaller sequence has reached the sink. Looks through
+  // every client: call it now and then, not per exchange.
+  uint64_t OldestHeld() const;
 
  private:
   struct Item {
@@ -55,8 +59,8 @@ class PageAssembler : public ExchangeSink {
     sm3gen::RecordKind kind = sm3gen::RecordKind::kObject;
     std::string key;          // its own URL, normalised
     std::string referer_key;  // its Referer, normalised; empty without one
-    bool hostless = false;    // its request named no host (an access log without one): its
-                              // URL is matched by path and query alone
+    bool hostless = false;    // its request named no host, or an assumed one (an access log
+                              // without one): its URL is matched by path and query alone
   };
   struct View {
     Item page;

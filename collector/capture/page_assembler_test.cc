@@ -144,6 +144,17 @@ TEST_F(PageAssemblerTest, PagesWithoutAHostMatchByPath) {
   Add(css);
   pages_.Flush();
   EXPECT_EQ(Written(), (Strings{"hpage /shop/index.html?a=1", "hobj /s.css"}));
+
+  // A host the log did not name but the operator gave (--host) matches by path too: the site
+  // may be reached, and referred to, under another name.
+  page.request.host = "shop.example";
+  page.host_assumed = true;
+  css.request.referer = "http://127.0.0.1:8080/shop/index.html?a=1";
+  Add(page);
+  Add(css);
+  pages_.Flush();
+  EXPECT_EQ(sink_.records.size(), 4u);
+  EXPECT_EQ(sink_.records[2].object_count, 1);
 }
 
 TEST_F(PageAssemblerTest, ObjectsWithoutTheirPageBecomePagesOfTheirOwn) {
@@ -166,6 +177,29 @@ TEST_F(PageAssemblerTest, ObjectsWithoutTheirPageBecomePagesOfTheirOwn) {
   pages_.Flush();
   EXPECT_EQ(Written().back(), "hpage /p.css");
   EXPECT_EQ(sink_.records[2].object_count, 0);
+}
+
+// What is still held, by the producer's sequence numbers: an open view's page and objects, and
+// an object waiting for its page; a page of its own never is.
+TEST_F(PageAssemblerTest, OldestHeldNamesTheEarliestUnwrittenExchange) {
+  const Micros t = 7000 * kSecond;
+  EXPECT_EQ(pages_.OldestHeld(), UINT64_MAX);
+  const auto add = [&](HttpExchange e, uint64_t sequence) {
+    e.sequence = sequence;
+    Add(e);
+  };
+  add(Exchange("/api/ping", "application/json", "", t, t + kMs), 1);
+  EXPECT_EQ(pages_.OldestHeld(), UINT64_MAX);
+  add(Exchange("/x.png", "image/png", "http://elsewhere.example/", t, t + kMs, 2), 2);
+  add(Exchange("/a.html", "text/html", "", t, t + 10 * kMs), 3);
+  add(Exchange("/a.css", "text/css", "http://shop.example/a.html", t, t + 20 * kMs), 4);
+  EXPECT_EQ(pages_.OldestHeld(), 2u);
+  pages_.Advance(t + 10 * kSecond);  // the view closed; the orphan still waits
+  EXPECT_EQ(Written(), (Strings{"hpage /api/ping", "hpage /a.html", "hobj /a.css"}));
+  EXPECT_EQ(pages_.OldestHeld(), 2u);
+  add(Exchange("/b.html", "text/html", "", t + 11 * kSecond, t + 11 * kSecond), 5);
+  pages_.Advance(t + 40 * kSecond);
+  EXPECT_EQ(pages_.OldestHeld(), UINT64_MAX);
 }
 
 TEST(RecordBuilderTest, FieldsFromAnExchange) {

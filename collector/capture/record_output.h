@@ -33,6 +33,9 @@ class RecordOutput : public RecordSink {
   // WaitForRoom blocks up to timeout for the reader to take some.
   virtual bool Backlogged() const { return false; }
   virtual void WaitForRoom(std::chrono::milliseconds) {}
+  // True when every record written so far has left the process (to the file, or into the
+  // FIFO): a producer may then count them as delivered.
+  virtual bool Drained() const = 0;
 };
 
 class FileOutput : public RecordOutput {
@@ -45,6 +48,7 @@ class FileOutput : public RecordOutput {
   void Write(const sm3gen::Record& record) override;
   bool Pump(std::string* error) override;
   bool Finish(std::chrono::steady_clock::time_point deadline, std::string* error) override;
+  bool Drained() const override { return buffer_.empty(); }
 
  private:
   bool WriteAll(std::string* error);
@@ -73,6 +77,7 @@ class FifoOutput : public RecordOutput {
 
   bool Backlogged() const override { return bytes_.size() - begun_ >= max_queued_ / 2; }
   void WaitForRoom(std::chrono::milliseconds timeout) override;
+  bool Drained() const override { return sent_ == bytes_.size(); }
 
   bool connected() const { return fd_.valid(); }
 
