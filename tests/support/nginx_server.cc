@@ -90,6 +90,10 @@ std::string NginxServer::AccessLog() const {
   return FileText(dir_ + "/nginx/logs/access.log");
 }
 
+std::string NginxServer::timed_log_path() const {
+  return dir_ + "/nginx/logs/timed.log";
+}
+
 bool NginxServer::Start(const std::string& locations, std::string* error) {
   // The port is free when picked but may be taken before nginx binds it: try a few.
   for (int attempt = 0; attempt < 5; ++attempt) {
@@ -120,7 +124,13 @@ bool NginxServer::StartOnce(const std::string& locations, std::string* error) {
       << "  default_type application/octet-stream;\n"
       << "  log_format timed '$remote_port \"$request\" $status $bytes_sent "
          "rt=$request_time urt=$upstream_response_time';\n"
-      << "  access_log " << home << "logs/access.log timed;\n"
+      << "  access_log " << home
+      << "logs/access.log timed;\n"
+      // The format the README asks operators to add, for sm3logs.
+      << "  log_format combined_timed '$remote_addr - $remote_user [$time_local] '\n"
+         "    '\"$request\" $status $body_bytes_sent \"$http_referer\" \"$http_user_agent\" '\n"
+         "    '$request_time $upstream_response_time';\n"
+      << "  access_log " << timed_log_path() << " combined_timed;\n"
       << temp_paths << "  server {\n    listen 127.0.0.1:" << port_ << ";\n    root " << root()
       << ";\n"
       << locations << "\n  }\n}\n";

@@ -44,6 +44,9 @@ class NginxServer {
   // nginx's error log (and access log, one line per request with its timings).
   std::string ErrorLog() const;
   std::string AccessLog() const;
+  // The same requests in the README's nginx-timed format (combined, then $request_time and
+  // $upstream_response_time), the log sm3logs reads.
+  std::string timed_log_path() const;
 
  private:
   bool StartOnce(const std::string& locations, std::string* error);

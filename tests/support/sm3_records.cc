@@ -43,13 +43,15 @@ std::vector<Record> ReadRecords(const std::string& path, std::string* error) {
   return records;
 }
 
-std::map<std::string, long> FinalCounters(const std::string& stderr_text) {
-  const size_t line = stderr_text.rfind("sm3capture: packets=");
+std::map<std::string, long> FinalCounters(const std::string& stderr_text,
+                                          const std::string& opening) {
+  const size_t line = stderr_text.rfind(opening);
   std::map<std::string, long> counters;
   if (line == std::string::npos) {
     return counters;
   }
-  std::istringstream words(stderr_text.substr(line + 12, stderr_text.find('\n', line) - line));
+  const size_t words_at = line + opening.find(' ') + 1;
+  std::istringstream words(stderr_text.substr(words_at, stderr_text.find('\n', line) - words_at));
   for (std::string word; words >> word;) {
     const size_t eq = word.find('=');
     if (eq != std::string::npos) {

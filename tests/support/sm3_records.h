@@ -1,7 +1,7 @@
 #pragma once
 
-// Test helpers: the .sm3 records sm3capture writes and the counters it prints at its end, read
-// back for comparison with what tshark and curl saw.
+// Test helpers: the .sm3 records sm3capture and sm3logs write and the counters it prints at its
+// end, read back for comparison with what tshark and curl saw.
 
 #include <map>
 #include <string>
@@ -64,8 +64,10 @@ struct Record {
 // layout are left out and described in *error.
 std::vector<Record> ReadRecords(const std::string& path, std::string* error);
 
-// The counters of sm3capture's closing line, "sm3capture: packets=N bytes=N ...", in its
-// standard error text; empty when there is none.
-std::map<std::string, long> FinalCounters(const std::string& stderr_text);
+// The counters of a collector's closing line, the last one that begins with `opening`
+// ("sm3capture: packets=N bytes=N ...", "sm3logs: lines=N ..."), in its standard error text;
+// empty when there is none.
+std::map<std::string, long> FinalCounters(const std::string& stderr_text,
+                                          const std::string& opening = "sm3capture: packets=");
 
 }  // namespace q7test
