@@ -102,8 +102,10 @@ _FILE_INFO_LL* CDPXFileManager::processOlderFiles(_FILE_INFO_LL* list) {
     if (!interrupted &&
         (!haveLast || !CCommon::newerFile(lastProcessedFile.c_str(), older->fileName))) {
       const long long offset = isLast ? lastProcessedOffset : 0;
-      const std::unique_ptr<CDPXDataFileMonitor> finished =
-          CDPXDataFileMonitor::processStatically(older->fileName, offset, -1, getAnalyzer());
+      // The outlier limit applies here too: whether a record counts must not depend on which
+      // files the first listing happened to find together.
+      const std::unique_ptr<CDPXDataFileMonitor> finished = CDPXDataFileMonitor::processStatically(
+          older->fileName, offset, getExcludeOutlierMillis(), getAnalyzer());
       if (finished->wasInterrupted()) {
         // Shutting down in the middle of the backlog: resume here next time, and leave the
         // newer files to be read from 0 then.

@@ -127,6 +127,19 @@ TEST_F(FileManagerTest, FirstStartReadsOlderFilesThenTailsTheNewest) {
   EXPECT_TRUE(urls(0).empty());
 }
 
+// The outlier limit holds for the first pass as for the live file: with 30 s, the oldest file's
+// record of 60 s is dropped, whichever files the first listing found.
+TEST_F(FileManagerTest, FirstPassDropsOutliersToo) {
+  CConfig::setExcludeOutlierSeconds(30);
+  append(dataFile("day1-0001.sm3"), page("/old/slow", 60000) + page("/old/ok", 29000));
+  append(dataFile("day1-0002.sm3"), page("/renamed"));
+  append(dataFile("day1.sm3"), page("/live/slow", 60000) + page("/live/ok"));
+  auto manager = startManager();
+  EXPECT_EQ((Strings{"/old/ok", "/renamed", "/live/ok"}), urls(3));
+  manager->Shutdown();
+  EXPECT_TRUE(urls(0).empty());
+}
+
 // A restart with a saved file skips older files, finishes the saved one from its offset, reads
 // newer ones whole and tails the newest from 0.
 TEST_F(FileManagerTest, RestartResumesTheSavedFile) {
