@@ -1,7 +1,10 @@
 #include "collector/capture/packet_decoder.h"
 
+#include <arpa/inet.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
+#include <array>
 #include <cstring>
 #include <string>
 #include <vector>
@@ -141,6 +144,23 @@ TEST(PacketDecoderTest, Ipv6WithExtensionHeader) {
   Bytes null6 = {10, 0, 0, 0};                          // Linux AF_INET6 on loopback
   null6.insert(null6.end(), raw6.begin(), raw6.end());
   EXPECT_EQ(Decode(0, null6, &s), DecodeResult::kTcp);
+}
+
+// IPv4 is formatted by hand; it must read as inet_ntop writes it, every octet width included.
+TEST(PacketDecoderTest, Ipv4AddressesFormatLikeInetNtop) {
+  for (const std::array<uint8_t, 4> octets : {std::array<uint8_t, 4>{0, 0, 0, 0},
+                                              {255, 255, 255, 255},
+                                              {10, 0, 100, 9},
+                                              {192, 168, 1, 20},
+                                              {1, 99, 100, 199}}) {
+    IpAddress a;
+    std::copy(octets.begin(), octets.end(), a.bytes.begin());
+    char mine[64];
+    char theirs[64];
+    FormatAddress(a, mine, sizeof(mine));
+    ASSERT_NE(inet_ntop(AF_INET, a.bytes.data(), theirs, sizeof(theirs)), nullptr);
+    EXPECT_STREQ(mine, theirs);
+  }
 }
 
 TEST(PacketDecoderTest, EthernetPaddingIsNotPayload) {

@@ -24,23 +24,28 @@ bool NeedsEscape(unsigned char c) {
   return c < 0x20 || c == 0x7F || c == '^' || c == '<';
 }
 
-// text, made safe for the record format and cut to width characters.
+// text, made safe for the record format and cut to width characters. Most text needs no
+// escape: runs up to the next character that does are copied whole.
 std::string Field(std::string_view text, size_t width) {
   std::string out;
   out.reserve(std::min(text.size(), width));
-  for (const char ch : text) {
-    const auto c = static_cast<unsigned char>(ch);
-    if (NeedsEscape(c)) {
-      if (out.size() + 3 > width) {
-        break;
-      }
-      out += fmt::format("%{:02X}", c);
-    } else {
-      if (out.size() + 1 > width) {
-        break;
-      }
-      out.push_back(ch);
+  size_t i = 0;
+  while (i < text.size() && out.size() < width) {
+    size_t run = i;
+    while (run < text.size() && !NeedsEscape(static_cast<unsigned char>(text[run]))) {
+      ++run;
     }
+    const size_t take = std::min(run - i, width - out.size());
+    out.append(text.data() + i, take);
+    i += take;
+    if (i < run || i == text.size()) {
+      break;  // cut at the width, or done
+    }
+    if (out.size() + 3 > width) {
+      break;
+    }
+    out += fmt::format("%{:02X}", static_cast<unsigned char>(text[i]));
+    ++i;
   }
   return out;
 }
