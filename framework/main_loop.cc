@@ -9,6 +9,7 @@
 
 #include "framework/agent_runtime.h"
 #include "framework/api_token.h"
+#include "framework/atomic_file.h"
 #include "framework/environment.h"
 #include "framework/http_server.h"
 #include "framework/runtime_state.h"
@@ -21,20 +22,12 @@ namespace {
 constexpr char kUnit[] = "framework";
 constexpr char kDefaultHttpAddress[] = "127.0.0.1:7420";
 
-// Writes the bound address where tests and q7ctl find it; temporary name first, so a reader
-// never sees half a line.
+// Writes the bound address where tests and q7ctl find it, replaced whole, so a reader never
+// sees half a line.
 void WriteAddressFile(const std::string& path, const std::string& address) {
-  const std::string tmp = path + ".tmp";
-  FILE* f = std::fopen(tmp.c_str(), "w");
-  if (f == nullptr) {
-    Q7_TRACE(kUnit, fw::kTraceError, "cannot write %s: %s", tmp.c_str(), std::strerror(errno));
-    return;
-  }
-  std::fprintf(f, "%s\n", address.c_str());
-  const bool ok = std::fclose(f) == 0;
-  if (!ok || std::rename(tmp.c_str(), path.c_str()) != 0) {
-    Q7_TRACE(kUnit, fw::kTraceError, "cannot write %s: %s", path.c_str(), std::strerror(errno));
-    std::remove(tmp.c_str());
+  std::string error;
+  if (fw::ReplaceFile(path, address + "\n", {}, nullptr, &error) != fw::kOk) {
+    Q7_TRACE(kUnit, fw::kTraceError, "%s", error.c_str());
   }
 }
 

@@ -16,6 +16,7 @@
 #include <nlohmann/json.hpp>
 #include <utility>
 
+#include "framework/atomic_file.h"
 #include "framework/row_filter.h"
 #include "framework/status.h"
 #include "framework/table_manager.h"
@@ -86,8 +87,8 @@ bool ParseInteger(std::string_view text, std::int64_t* value) {
   return error == std::errc() && end == text.data() + text.size();
 }
 
-// Writes the list to the file: a temporary file in the same directory, flushed, then renamed,
-// so a crash leaves the old list or the new one, never half of one. Registry mutex held.
+// Writes the list to the file, replaced whole: a crash leaves the old list or the new one,
+// never half of one. Registry mutex held.
 int Persist(const Registry& registry, std::string* error) {
   if (registry.file.empty()) {
     return kOk;
@@ -98,18 +99,8 @@ int Persist(const Registry& registry, std::string* error) {
   }
   const std::string text =
       list.dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace) + "\n";
-  const std::string tmp = registry.file + ".tmp";
-  const int fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-  bool ok = fd >= 0;
-  if (ok) {
-    ok = ::write(fd, text.data(), text.size()) == static_cast<ssize_t>(text.size());
-    ok = ::fsync(fd) == 0 && ok;
-    ok = ::close(fd) == 0 && ok;
-  }
-  if (!ok || std::rename(tmp.c_str(), registry.file.c_str()) != 0) {
-    *error = "cannot write " + registry.file + ": " + std::strerror(errno);
+  if (ReplaceFile(registry.file, text, {0600, ""}, nullptr, error) != kOk) {
     Q7_TRACE(kUnit, kTraceError, "%s", error->c_str());
-    std::remove(tmp.c_str());
     return kIoError;
   }
   return kOk;

@@ -6,10 +6,13 @@
 #include <cerrno>
 #include <cstring>
 #include <new>
+#include <string>
 
 #include "core/analyzer/common.h"
 #include "core/history/file_io.h"
 #include "core/runtime/clog.h"
+#include "framework/atomic_file.h"
+#include "framework/status.h"
 #include "tama/cconfig.h"
 
 CFileManager::CFileManager(const char* threadName) : CvelThread(threadName) {
@@ -51,29 +54,30 @@ bool CFileManager::persistLastProcessedFile(_LAST_FILE_INFO* list) {
   CLOG::max("%s Need to persist to [%s] that the last file was[%s] and offset[%ld]", kWhere, path,
             list != nullptr ? list->fileName : "",
             list != nullptr ? static_cast<long>(list->fullOffset()) : 0L);
-  history::UniqueFd fd(::open(path, O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
-  if (!fd.valid()) {
-    CLOG::error("ERROR opening persist file[%s] errno[%d]", path, errno);
-    return false;
-  }
-  bool ok = true;
+  std::string image;
   for (_LAST_FILE_INFO* record = list; record != nullptr; record = record->next) {
     record->recordType = persistRecordType;
     const LastFileInfoBytes bytes = encodeLastFileInfo(*record);
-    if (!history::WriteAll(fd.get(), bytes.data(), bytes.size())) {
-      CLOG::error("\aERROR: Failed[%d] to write [%d] bytes", errno, kLastFileInfoRecordSize);
-      ok = false;
+    image.append(reinterpret_cast<const char*>(bytes.data()), bytes.size());
+  }
+  // Replaced whole, never rewritten in place: a crash or a power cut while saving leaves the
+  // previous record, from which the next start resumes, rather than an empty file.
+  fw::ReplaceResult result;
+  if (fw::ReplaceFile(path, image, {0600, ""}, &result) == fw::kOk) {
+    return true;
+  }
+  switch (result.failed) {
+    case fw::ReplaceStep::kCreate:
+      CLOG::error("ERROR opening persist file[%s] errno[%d]", path, result.error_number);
       break;
-    }
+    case fw::ReplaceStep::kWrite:
+      CLOG::error("\aERROR: Failed[%d] to write [%d] bytes", result.error_number,
+                  kLastFileInfoRecordSize);
+      break;
+    default:
+      CLOG::error("ERROR failed[%d] to close persist file, handle[%d]", result.error_number, -1);
   }
-  // The next start resumes from this record: make it survive a power cut.
-  ::fsync(fd.get());
-  const int handle = fd.release();
-  if (::close(handle) != 0) {
-    CLOG::error("ERROR failed[%d] to close persist file, handle[%d]", errno, handle);
-    ok = false;
-  }
-  return ok;
+  return false;
 }
 
 _LAST_FILE_INFO* CFileManager::getLastProcessedFile() {

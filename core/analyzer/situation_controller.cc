@@ -13,8 +13,11 @@
 #include <utility>
 
 #include "core/analyzer/pattern_overlap.h"
+#include "core/history/file_io.h"
 #include "core/runtime/clog.h"
 #include "core/runtime/misc.h"
+#include "framework/atomic_file.h"
+#include "framework/status.h"
 
 // Pattern files: a format version word (uint32, host byte order) followed by fixed-size records
 // in matching order. Texts take their full field width, NUL-padded; numbers are in host byte
@@ -134,39 +137,6 @@ std::string StartImage() {
   return image;
 }
 
-// Owns a file descriptor.
-class Fd {
- public:
-  explicit Fd(int fd) : fd_(fd) {}
-  ~Fd() {
-    if (fd_ >= 0) {
-      ::close(fd_);
-    }
-  }
-  Fd(const Fd&) = delete;
-  Fd& operator=(const Fd&) = delete;
-  int get() const { return fd_; }
-  bool valid() const { return fd_ >= 0; }
-
- private:
-  int fd_;
-};
-
-bool WriteAll(int fd, const char* data, size_t size) {
-  while (size > 0) {
-    const ssize_t n = ::write(fd, data, size);
-    if (n < 0 && errno == EINTR) {
-      continue;
-    }
-    if (n <= 0) {
-      return false;
-    }
-    data += n;
-    size -= static_cast<size_t>(n);
-  }
-  return true;
-}
-
 bool ReadAll(int fd, char* data, size_t size) {
   size_t done = 0;
   while (done < size) {
@@ -214,7 +184,7 @@ long RecordCount(const std::string& image, size_t recordSize, const char* path) 
 template <typename File>
 bool ReadIfNewer(File& file, std::string* image) {
   static constexpr const char* kWhere = "CSituationController::loadPatternsIfNewer";
-  Fd fd(::open(file.path.c_str(), O_RDONLY | O_CLOEXEC));
+  history::UniqueFd fd(::open(file.path.c_str(), O_RDONLY | O_CLOEXEC));
   if (!fd.valid()) {
     if (errno != ENOENT) {
       CLOG::error("%s: cannot open %s: %s", kWhere, file.path.c_str(), strerror(errno));
@@ -560,36 +530,15 @@ std::vector<ClientPattern> CSituationController::getClientPatterns() const {
 
 void CSituationController::write(PatternFile& file, const std::string& image) {
   static constexpr const char* kWhere = "CSituationController::write";
-  // A private temporary name in the same directory: the rename then replaces the file in one
-  // step, and readers see either the old patterns or all of the new ones.
-  std::string temp = file.path + ".XXXXXX";
-  int raw = ::mkostemp(temp.data(), O_CLOEXEC);
-  if (raw < 0 && errno == ENOENT && CMisc::mkdirs(directory_.c_str()) == 0) {
-    temp = file.path + ".XXXXXX";
-    raw = ::mkostemp(temp.data(), O_CLOEXEC);
-  }
-  if (raw < 0) {
-    CLOG::error("%s: cannot create a file in %s: %s", kWhere, directory_.c_str(), strerror(errno));
+  // Readers see either the old patterns or all of the new ones; the modification time of what
+  // we wrote is kept, so a write by someone else after ours is never mistaken for our own.
+  fw::ReplaceResult result;
+  std::string error;
+  if (fw::ReplaceFile(file.path, image, {0644, ""}, &result, &error) != fw::kOk) {
+    CLOG::error("%s: %s", kWhere, error.c_str());
     return;
   }
-  Fd fd(raw);
-  struct stat st {};
-  // The modification time is taken before the rename, which leaves it alone, so a write by
-  // someone else after ours can never be mistaken for our own.
-  const bool written = ::fchmod(fd.get(), 0644) == 0 &&
-                       WriteAll(fd.get(), image.data(), image.size()) && ::fsync(fd.get()) == 0 &&
-                       ::fstat(fd.get(), &st) == 0 &&
-                       ::rename(temp.c_str(), file.path.c_str()) == 0;
-  if (!written) {
-    CLOG::error("%s: cannot write %s: %s", kWhere, file.path.c_str(), strerror(errno));
-    ::unlink(temp.c_str());
-    return;
-  }
-  file.loaded = st.st_mtim;
-  Fd directory(::open(directory_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (directory.valid()) {
-    ::fsync(directory.get());  // best effort: makes the rename itself durable
-  }
+  file.loaded = result.modified;
 }
 
 template <typename Pattern>

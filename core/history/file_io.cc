@@ -20,15 +20,6 @@ std::string ParentOf(const std::string& path) {
   return slash == 0 ? "/" : path.substr(0, slash);
 }
 
-// Best effort: a failure leaves the rename possibly undone after a power loss, never a
-// half-written file, so it is not reported.
-void SyncDirectory(const std::string& dir) {
-  UniqueFd fd(::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (fd.valid()) {
-    ::fsync(fd.get());
-  }
-}
-
 }  // namespace
 
 UniqueFd& UniqueFd::operator=(UniqueFd&& other) noexcept {
@@ -103,25 +94,6 @@ off_t FileSize(int fd) {
     return -1;
   }
   return st.st_size;
-}
-
-bool ReplaceFileContents(const std::string& path, const std::string& temp_path, const void* data,
-                         size_t size) {
-  bool ok = false;
-  {
-    UniqueFd fd = OpenCreatingParent(temp_path, O_WRONLY | O_CREAT | O_TRUNC);
-    // Without the fsync before the rename, a power loss could leave the new name pointing at
-    // blocks that were never written.
-    ok = fd.valid() && WriteAll(fd.get(), data, size) && ::fsync(fd.get()) == 0;
-  }
-  if (ok && ::rename(temp_path.c_str(), path.c_str()) == 0) {
-    SyncDirectory(ParentOf(path));
-    return true;
-  }
-  const int saved = errno;
-  ::unlink(temp_path.c_str());
-  errno = saved;
-  return false;
 }
 
 }  // namespace history

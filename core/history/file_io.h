@@ -1,9 +1,8 @@
 #pragma once
 
 // Small POSIX file helpers shared by the history store, the instance files and the state file:
-// an owning file descriptor, whole-buffer reads and writes that survive short transfers and
-// EINTR, and the write-to-temporary-then-rename step that keeps half-written files away from
-// their final names.
+// an owning file descriptor, and whole-buffer reads and writes that survive short transfers and
+// EINTR. Whole files are replaced with fw::ReplaceFile (framework/atomic_file.h).
 //
 // Nothing here traces; failures come back as results with errno set by the failing call, so the
 // caller can name the file it was working on.
@@ -52,12 +51,5 @@ ssize_t ReadAt(int fd, void* out, size_t size, off_t offset);
 
 // Size of the open file, or -1 when fstat fails.
 off_t FileSize(int fd);
-
-// Replaces `path` with `size` bytes of `data`: writes `temp_path` (same directory), fsyncs it
-// and renames it over `path`, so `path` holds either its old contents or all the new ones,
-// whenever the process stops. The temporary file is removed on failure. The directory is
-// fsynced afterwards on a best-effort basis so the rename itself survives a power loss.
-bool ReplaceFileContents(const std::string& path, const std::string& temp_path, const void* data,
-                         size_t size);
 
 }  // namespace history

@@ -14,6 +14,8 @@
 #include "core/history/file_io.h"
 #include "core/history/history_file_name.h"
 #include "core/runtime/clog.h"
+#include "framework/atomic_file.h"
+#include "framework/status.h"
 
 namespace history {
 
@@ -110,8 +112,11 @@ bool HistoryStore::saveInterval(int64_t interval, std::string_view stem, const v
     }
     return true;
   }
-  const std::string temp = directory_ + "/" + TemporaryFileName(interval, stem);
-  if (!ReplaceFileContents(path, temp, records, record_size * count)) {
+  // A fixed temporary name, so that cleanup recognises what a crash left behind.
+  fw::ReplaceOptions options;
+  options.temp_path = directory_ + "/" + TemporaryFileName(interval, stem);
+  const std::string_view bytes(static_cast<const char*>(records), record_size * count);
+  if (fw::ReplaceFile(path, bytes, options) != fw::kOk) {
     CLOG::error("%s cannot write %s: %s", kWhere, path.c_str(), std::strerror(errno));
     return false;
   }

@@ -9,6 +9,8 @@
 
 #include "core/history/file_io.h"
 #include "core/runtime/clog.h"
+#include "framework/atomic_file.h"
+#include "framework/status.h"
 
 namespace history {
 
@@ -85,7 +87,7 @@ bool StateFile::save() const {
     text += std::to_string(seconds);
     text += '\n';
   }
-  if (!ReplaceFileContents(path_, path_ + ".tmp", text.data(), text.size())) {
+  if (fw::ReplaceFile(path_, text, {0644, path_ + ".tmp"}) != fw::kOk) {
     CLOG::error("StateFile::save cannot write %s: %s", path_.c_str(), std::strerror(errno));
     return false;
   }

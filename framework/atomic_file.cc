@@ -1,0 +1,113 @@
+#include "framework/atomic_file.h"
+
+#include <errno.h>
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+
+#include "framework/status.h"
+
+namespace fw {
+namespace {
+
+std::string ParentOf(const std::string& path) {
+  const size_t slash = path.rfind('/');
+  if (slash == std::string::npos) {
+    return ".";
+  }
+  return slash == 0 ? "/" : path.substr(0, slash);
+}
+
+bool WriteAll(int fd, std::string_view bytes) {
+  while (!bytes.empty()) {
+    const ssize_t n = ::write(fd, bytes.data(), bytes.size());
+    if (n < 0 && errno == EINTR) {
+      continue;
+    }
+    if (n <= 0) {
+      if (n == 0) {
+        errno = EIO;
+      }
+      return false;
+    }
+    bytes.remove_prefix(static_cast<size_t>(n));
+  }
+  return true;
+}
+
+// Creates the temporary file, and the directories above it when they are missing.
+int CreateTemp(std::string* temp, bool unique) {
+  const auto create = [&] {
+    if (unique) {
+      return ::mkostemp(temp->data(), O_CLOEXEC);
+    }
+    return ::open(temp->c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+  };
+  const std::string pattern = *temp;
+  int fd = create();
+  if (fd < 0 && errno == ENOENT) {
+    std::error_code ec;
+    std::filesystem::create_directories(ParentOf(pattern), ec);
+    *temp = pattern;  // mkostemp rewrote the X's
+    fd = create();
+    if (fd < 0 && ec) {
+      errno = ec.value();
+    }
+  }
+  return fd;
+}
+
+}  // namespace
+
+int ReplaceFile(const std::string& path, std::string_view contents, const ReplaceOptions& options,
+                ReplaceResult* result, std::string* error) {
+  ReplaceResult local;
+  ReplaceResult& r = result != nullptr ? *result : local;
+  r = ReplaceResult{};
+  const bool unique = options.temp_path.empty();
+  std::string temp = unique ? path + ".tmp.XXXXXX" : options.temp_path;
+  const auto fail = [&](ReplaceStep step) {
+    r.failed = step;
+    r.error_number = errno;
+    if (error != nullptr) {
+      *error = "cannot write " + path + ": " + std::strerror(r.error_number);
+    }
+    if (step != ReplaceStep::kCreate) {
+      ::unlink(temp.c_str());
+    }
+    errno = r.error_number;
+    return kIoError;
+  };
+
+  const int fd = CreateTemp(&temp, unique);
+  if (fd < 0) {
+    return fail(ReplaceStep::kCreate);
+  }
+  struct stat st {};
+  // Without the fsync before the rename, a power cut could leave the new name pointing at
+  // blocks that were never written. The time is taken before the rename, which keeps it, so a
+  // later write by someone else is never mistaken for this one.
+  bool written = ::fchmod(fd, options.mode) == 0 && WriteAll(fd, contents) && ::fsync(fd) == 0 &&
+                 ::fstat(fd, &st) == 0;
+  const int saved = errno;
+  written = ::close(fd) == 0 && written;
+  if (!written) {
+    errno = saved != 0 ? saved : errno;
+    return fail(ReplaceStep::kWrite);
+  }
+  r.modified = st.st_mtim;
+  if (::rename(temp.c_str(), path.c_str()) != 0) {
+    return fail(ReplaceStep::kRename);
+  }
+  const int dir = ::open(ParentOf(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  if (dir >= 0) {
+    ::fsync(dir);  // best effort: makes the rename itself durable
+    ::close(dir);
+  }
+  return kOk;
+}
+
+}  // namespace fw
