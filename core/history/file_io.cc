@@ -5,22 +5,11 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <filesystem>
 
 #include "core/runtime/misc.h"
 
 namespace history {
-
-namespace {
-
-std::string ParentOf(const std::string& path) {
-  const size_t slash = path.rfind('/');
-  if (slash == std::string::npos) {
-    return ".";
-  }
-  return slash == 0 ? "/" : path.substr(0, slash);
-}
-
-}  // namespace
 
 UniqueFd& UniqueFd::operator=(UniqueFd&& other) noexcept {
   if (this != &other) {
@@ -46,7 +35,7 @@ void UniqueFd::reset(int fd) {
 UniqueFd OpenCreatingParent(const std::string& path, int flags, mode_t mode) {
   UniqueFd fd(::open(path.c_str(), flags | O_CLOEXEC, mode));
   if (!fd.valid() && errno == ENOENT && (flags & O_CREAT) != 0) {
-    if (CMisc::mkdirs(ParentOf(path).c_str()) == 0) {
+    if (CMisc::mkdirs(std::filesystem::path(path).parent_path().c_str()) == 0) {
       fd.reset(::open(path.c_str(), flags | O_CLOEXEC, mode));
     }
   }
