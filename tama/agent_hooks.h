@@ -9,6 +9,7 @@
 
 #include <functional>
 #include <memory>
+#include <nlohmann/json_fwd.hpp>
 #include <string>
 #include <vector>
 
@@ -44,6 +45,10 @@ struct AgentHooks {
   // Creates a collector process monitor (not yet started).
   std::function<std::unique_ptr<CollectorMonitor>(const CollectorMonitorSpec&)>
       make_collector_monitor;
+  // Adds the analyzer's state and counters to a JSON object: "state" (not started, running,
+  // stopping, stopped) and "counters" (records read, unparsed and dropped as outliers,
+  // transactions processed and ignored, queue depth, the file and offset being read).
+  std::function<void(nlohmann::json& out)> describe_analyzer;
   // Sends an agent message by key with a severity and substitution arguments.
   std::function<void(const char* key, int severity, const std::vector<std::string>& args)>
       send_agent_message;

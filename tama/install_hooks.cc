@@ -1,5 +1,7 @@
 #include "tama/install_hooks.h"
 
+#include <nlohmann/json.hpp>
+
 #include "core/analyzer/dpx_analyzer.h"
 #include "core/analyzer/dpx_file_manager.h"
 #include "q7tema/pattern_tables.h"
@@ -20,8 +22,9 @@ namespace {
   X(appsm)                                                                                     \
   X(clntapp)                                                                                   \
   X(clntot)                                                                                    \
-  X(clntsm) X(clntsrv) X(srvappsm) X(srvot) X(srvsm) X(txins) X(txot) X(txsm) X(txcs) X(appcs) \
-      X(clntcs) X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
+  X(clntsm)                                                                                    \
+  X(clntsrv) X(srvappsm) X(srvot) X(srvsm) X(txins) X(txot) X(txsm) X(txcs) X(appcs) X(clntcs) \
+      X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
 
 void installRowQueries() {
 #define Q7_ROW_QUERY(name)                                                       \
@@ -70,6 +73,24 @@ void installPatternHooks() {
   q7tema::SetPatternHooks(std::move(hooks));
 }
 
+void describeAnalyzer(nlohmann::json& out) {
+  CDPXAnalyzer* const analyzer = CDPXAnalyzer::GetInstanceNoStart();
+  const int thread = analyzer->GetState();
+  out["state"] = thread == CvelThread::kStateRunning
+                     ? (analyzer->isShutdownRequested() ? "stopping" : "running")
+                 : thread == CvelThread::kStateFinished ? "stopped"
+                                                        : "not started";
+  const IntakeCounters::Snapshot intake = analyzer->intakeCounters().snapshot();
+  out["counters"] = {{"records_read", intake.recordsRead},
+                     {"records_unparsed", intake.recordsUnparsed},
+                     {"outliers_dropped", intake.outliersDropped},
+                     {"transactions_processed", analyzer->getTransactionsProcessed()},
+                     {"transactions_ignored", analyzer->getTransactionsIgnored()},
+                     {"queue_depth", analyzer->getQueueDepth()},
+                     {"file", intake.file},
+                     {"offset", intake.offset}};
+}
+
 }  // namespace
 
 void installAgentHooks() {
@@ -77,6 +98,7 @@ void installAgentHooks() {
   hooks.start_analyzer = [] { CDPXAnalyzer::GetInstance(); };
   hooks.shutdown_analyzer = [] { CDPXAnalyzer::GetInstanceNoStart()->Shutdown(); };
   hooks.join_analyzer = [] { CDPXAnalyzer::GetInstanceNoStart()->Join(); };
+  hooks.describe_analyzer = &describeAnalyzer;
   hooks.make_collector_monitor = &makeServiceMonitor;
   hooks.send_agent_message = [](const char* key, int severity,
                                 const std::vector<std::string>& args) {

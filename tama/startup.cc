@@ -40,10 +40,22 @@ void describeAgent(nlohmann::json& info) {
     properties[name] = AgentProperties::getAgentProperty(name);
   }
   info["properties"] = std::move(properties);
+  if (tama::agentHooks().describe_analyzer) {
+    nlohmann::json analyzer;
+    tama::agentHooks().describe_analyzer(analyzer);
+    info["analyzer"] = analyzer["state"];
+    info["counters"] = analyzer["counters"];
+  }
 }
 
 void describeHealth(nlohmann::json& health) {
-  health["analyzer"] = tama::agentHooks().start_analyzer ? "running" : "not built";
+  if (tama::agentHooks().describe_analyzer) {
+    nlohmann::json analyzer;
+    tama::agentHooks().describe_analyzer(analyzer);
+    health["analyzer"] = analyzer["state"];
+  } else {
+    health["analyzer"] = "not built";
+  }
   std::lock_guard<std::mutex> lock(g_collector_state_mutex);
   health["collector"] = g_collector_state;
 }

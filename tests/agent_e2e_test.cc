@@ -58,6 +58,7 @@ TEST_F(AgentE2ETest, StartsServesAndStopsOnSigterm) {
   nlohmann::json health = get(address, "/healthz", &status);
   EXPECT_EQ(200, status);
   EXPECT_EQ("ok", health.value("status", ""));
+  EXPECT_EQ("running", health.value("analyzer", ""));
   EXPECT_EQ("not supervised (DPX_NOSTART)", health.value("collector", ""));
 
   nlohmann::json agent = get(address, "/api/v1/agent", &status);
@@ -282,6 +283,24 @@ TEST_F(AgentE2ETest, FedTransactionsReachTheTables) {
   const std::string csv = getText(address, "/api/v1/tables/Q7TXSM?format=csv&limit=1");
   EXPECT_EQ(0u, csv.find("applicatin,transactn,client,server,rootuuid,importance,originnode,"))
       << csv.substr(0, 200);
+
+  // The agent's own account: every record read, from the feed to its end, none waiting.
+  nlohmann::json agent;
+  EXPECT_TRUE(waitFor(
+      [&] {
+        agent = get(address, "/api/v1/agent", &status);
+        return agent["counters"].value("records_read", -1) == 400 &&
+               agent["counters"].value("queue_depth", -1) == 0;
+      },
+      10s))
+      << agent.dump();
+  const nlohmann::json& counters = agent["counters"];
+  EXPECT_EQ("running", agent.value("analyzer", ""));
+  EXPECT_EQ(0, counters.value("records_unparsed", -1));
+  EXPECT_EQ(0, counters.value("outliers_dropped", -1));
+  EXPECT_EQ(0, counters.value("queue_depth", -1));
+  EXPECT_EQ(data, counters.value("file", ""));
+  EXPECT_EQ(static_cast<long>(std::filesystem::file_size(data)), counters.value("offset", -1L));
   stopWith(SIGTERM);
 }
 

@@ -12,6 +12,7 @@
 #include <cstdint>
 #include <memory>
 
+#include "core/analyzer/intake_counters.h"
 #include "core/runtime/tvel_queue.h"
 #include "core/runtime/typed_transaction.h"
 
@@ -65,9 +66,15 @@ class CAnalyzer {
 
   CSituationController& situations() { return *situationController; }
 
+  // What the data file monitors read; they write it, anyone reads it.
+  IntakeCounters& intakeCounters() { return intake; }
+  const IntakeCounters& intakeCounters() const { return intake; }
+
   int32_t getTransactionsProcessed() const { return transactionsProcessed.load(); }
   int32_t getTransactionsIgnored() const { return transactionsIgnored.load(); }
   int32_t getQueueDepthHint() const;
+  // Transactions waiting in the queue now.
+  long getQueueDepth() const { return newQueue ? newQueue->Size() : 0; }
 
  protected:
   std::unique_ptr<CSituationController> situationController;
@@ -81,4 +88,5 @@ class CAnalyzer {
   // Created at construction, recreated by add() should it ever be missing; the analyzer
   // thread alone takes items out.
   std::unique_ptr<TvelQueue<_TYPED_TRANSACTION>> newQueue;
+  IntakeCounters intake;
 };

@@ -37,11 +37,15 @@ class CDPXDataFileMonitor::RecordSink : public CSM3RecordSink {
       refused = true;
       return false;
     }
+    IntakeCounters& counters = analyzer.intakeCounters();
+    counters.recordRead();
     std::unique_ptr<CDPXTransaction> transaction = createDPXTransaction(line, recordType);
     if (!transaction) {
+      counters.recordUnparsed();
       return true;
     }
     if (!isValidTrans(*transaction, excludeOutlierMillis)) {
+      counters.outlierDropped();
       CLOG::min("%s Ignoring transaction, determined to be \"invalid\"", "processSM3Line");
       return true;
     }
@@ -167,6 +171,7 @@ void CDPXDataFileMonitor::Run() {
     analyzer = CDPXAnalyzer::GetInstanceNoStart();
   }
   RecordSink sink(*analyzer, getExcludeOutlierMillis());
+  analyzer->intakeCounters().reading(getFile(), getLastProcessedOffset());
   while (!isShutdownRequested()) {
     bool updates = anyUpdates();
     if (!updates) {
@@ -192,6 +197,7 @@ void CDPXDataFileMonitor::Run() {
                     static_cast<unsigned>(length));
         }
         advanceLastProcessedOffset(consumed);
+        analyzer->intakeCounters().reading(getFile(), getLastProcessedOffset());
       } else {
         CLOG::trace(kFlowFlag, "Failed to read in any new file contents");
       }

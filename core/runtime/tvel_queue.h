@@ -106,6 +106,8 @@ class TvelQueue {
 
   bool IsFull() const { return v_numofitems.load(std::memory_order_relaxed) == v_currentmaxitem; }
   bool IsEmpty() const { return v_numofitems.load(std::memory_order_relaxed) == 0; }
+  // Items queued now; from any thread, a moment's figure.
+  long Size() const { return v_numofitems.load(std::memory_order_relaxed); }
 
   // Rewinds the indices and wakes producers without touching the count. Only the destructor may
   // call it: the queue is inconsistent afterwards.
