@@ -47,7 +47,8 @@ struct AgentHooks {
       make_collector_monitor;
   // Adds the analyzer's state and counters to a JSON object: "state" (not started, running,
   // stopping, stopped) and "counters" (records read, unparsed and dropped as outliers,
-  // transactions processed and ignored, queue depth, the file and offset being read).
+  // transactions processed, ignored and taken from the queue, queue depth, the file and
+  // offset being read).
   std::function<void(nlohmann::json& out)> describe_analyzer;
   // Sends an agent message by key with a severity and substitution arguments.
   std::function<void(const char* key, int severity, const std::vector<std::string>& args)>

@@ -17,14 +17,16 @@ namespace tama {
 namespace {
 
 // The exported row tables the analyzer answers.
-#define Q7_ANALYZER_ROW_TABLES(X)                                                              \
-  X(appot)                                                                                     \
-  X(appsm)                                                                                     \
-  X(clntapp)                                                                                   \
-  X(clntot)                                                                                    \
-  X(clntsm)                                                                                    \
-  X(clntsrv) X(srvappsm) X(srvot) X(srvsm) X(txins) X(txot) X(txsm) X(txcs) X(appcs) X(clntcs) \
-      X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
+#define Q7_ANALYZER_ROW_TABLES(X)                                                           \
+  X(appot)                                                                                  \
+  X(appsm)                                                                                  \
+  X(clntapp)                                                                                \
+  X(clntot)                                                                                 \
+  X(clntsm)                                                                                 \
+  X(clntsrv)                                                                                \
+  X(srvappsm)                                                                               \
+  X(srvot) X(srvsm) X(txins) X(txot) X(txsm) X(txcs) X(appcs) X(clntcs) X(srvcs) X(subtxsm) \
+      X(subtxot) X(subtxins)
 
 void installRowQueries() {
 #define Q7_ROW_QUERY(name)                                                       \
@@ -74,7 +76,12 @@ void installPatternHooks() {
 }
 
 void describeAnalyzer(nlohmann::json& out) {
-  CDPXAnalyzer* const analyzer = CDPXAnalyzer::GetInstanceNoStart();
+  CDPXAnalyzer* const analyzer = CDPXAnalyzer::GetInstanceIfStarted();
+  if (analyzer == nullptr) {
+    out["state"] = "not started";
+    out["counters"] = nlohmann::json::object();
+    return;
+  }
   const int thread = analyzer->GetState();
   out["state"] = thread == CvelThread::kStateRunning
                      ? (analyzer->isShutdownRequested() ? "stopping" : "running")
@@ -86,6 +93,7 @@ void describeAnalyzer(nlohmann::json& out) {
                      {"outliers_dropped", intake.outliersDropped},
                      {"transactions_processed", analyzer->getTransactionsProcessed()},
                      {"transactions_ignored", analyzer->getTransactionsIgnored()},
+                     {"transactions_taken", analyzer->getTransactionsTaken()},
                      {"queue_depth", analyzer->getQueueDepth()},
                      {"file", intake.file},
                      {"offset", intake.offset}};

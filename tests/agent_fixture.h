@@ -110,6 +110,30 @@ class AgentE2ETest : public ::testing::Test {
     return nlohmann::json::parse(res->body, nullptr, false);
   }
 
+  // Waits until the agent has read the data file `file` to its end and finished with every
+  // transaction it queued: from then on its tables change only when a file grows. The monitor
+  // may leave a final line end unread, so one byte short of the end counts as the end.
+  bool waitForIntakeIdle(const std::string& address, const std::string& file,
+                         std::chrono::milliseconds timeout) {
+    nlohmann::json counters;
+    const bool idle = waitFor(
+        [&] {
+          int status = 0;
+          counters = get(address, "/api/v1/agent", &status)["counters"];
+          std::error_code ec;
+          const auto size = static_cast<long long>(std::filesystem::file_size(file, ec));
+          const auto number = [&](const char* name) { return counters.value(name, -1LL); };
+          const long long queued =
+              number("records_read") - number("records_unparsed") - number("outliers_dropped");
+          return status == 200 && !ec && counters.value("file", "") == file &&
+                 number("offset") >= size - 1 && number("queue_depth") == 0 &&
+                 number("transactions_taken") == queued;
+        },
+        timeout);
+    EXPECT_TRUE(idle) << "intake not idle on " << file << ": " << counters.dump();
+    return idle;
+  }
+
   // Sends sig and checks the exit status 0 within 2 seconds.
   void stopWith(int sig) {
     const auto sent = std::chrono::steady_clock::now();

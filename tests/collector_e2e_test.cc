@@ -48,18 +48,26 @@ class CollectorE2ETest : public AgentE2ETest {
   }
 };
 
-TEST_F(CollectorE2ETest, AMinuteOfSimulatedTrafficCountedExactly) {
+TEST_F(CollectorE2ETest, SimulatedTrafficAcrossRolloversCountedExactly) {
   const std::string data = useDataDirectory();
   installCollector(data);
   registerCatchAllPattern();
   superviseCollector_ = true;
   const std::string address = start();
 
-  std::this_thread::sleep_for(30s);
   // Both processes run, named by their pid files.
-  EXPECT_FALSE(readFile(pidFile("zolt414_")).empty());
-  EXPECT_FALSE(readFile(pidFile("zelt_")).empty());
-  std::this_thread::sleep_for(30s);
+  EXPECT_TRUE(waitFor(
+      [&] { return !readFile(pidFile("zolt414_")).empty() && !readFile(pidFile("zelt_")).empty(); },
+      30s));
+  // The writer rolls the live file over as it fills: let it do so several times.
+  const auto rolledFiles = [&] {
+    int rolled = 0;
+    for (const auto& entry : std::filesystem::directory_iterator(data)) {
+      rolled += entry.path().filename().string().find('-') != std::string::npos ? 1 : 0;
+    }
+    return rolled;
+  };
+  EXPECT_TRUE(waitFor([&] { return rolledFiles() >= 5; }, 120s)) << rolledFiles();
 
   // The agent stops the writer, then the capture process, then itself.
   agent_->signal(SIGTERM);
@@ -68,11 +76,6 @@ TEST_F(CollectorE2ETest, AMinuteOfSimulatedTrafficCountedExactly) {
   EXPECT_TRUE(WIFEXITED(*status) && WEXITSTATUS(*status) == 0);
   EXPECT_FALSE(std::filesystem::exists(pidFile("zolt414_")));
   EXPECT_FALSE(std::filesystem::exists(pidFile("zelt_")));
-  int rolled = 0;
-  for (const auto& entry : std::filesystem::directory_iterator(data)) {
-    rolled += entry.path().filename().string().find('-') != std::string::npos ? 1 : 0;
-  }
-  EXPECT_GE(rolled, 5) << "the live file should have rolled over several times";
 
   // What reached the files, per application.
   const nlohmann::json truth =
@@ -86,22 +89,14 @@ TEST_F(CollectorE2ETest, AMinuteOfSimulatedTrafficCountedExactly) {
       pages += n;
     }
   }
-  ASSERT_GT(pages, 10000);  // pages are about one record in seven
+  ASSERT_GT(pages, 0);
 
   // Restarted without the collector, the agent reads what it had not read yet.
   superviseCollector_ = false;
   const std::string again = start();
+  ASSERT_TRUE(waitForIntakeIdle(again, data + "/traffic.sm3", 30s));
   int code = 0;
-  nlohmann::json summary;
-  EXPECT_TRUE(waitFor(
-      [&] {
-        summary = get(again, "/api/v1/tables/Q7TXSM", &code);
-        return totalRequests(summary) >= pages;
-      },
-      30s))
-      << totalRequests(summary) << " of " << pages;
-  std::this_thread::sleep_for(1500ms);
-  summary = get(again, "/api/v1/tables/Q7TXSM", &code);
+  const nlohmann::json summary = get(again, "/api/v1/tables/Q7TXSM", &code);
   EXPECT_EQ(pages, totalRequests(summary));
   const nlohmann::json apps = get(again, "/api/v1/tables/Q7APPSM", &code);
   std::map<std::string, long> counted;

@@ -72,6 +72,9 @@ class CAnalyzer {
 
   int32_t getTransactionsProcessed() const { return transactionsProcessed.load(); }
   int32_t getTransactionsIgnored() const { return transactionsIgnored.load(); }
+  // Transactions taken from the queue and done with, whatever became of them; with the queue
+  // empty and this equal to what the intake queued, the tables are final.
+  int64_t getTransactionsTaken() const { return transactionsTaken.load(); }
   int32_t getQueueDepthHint() const;
   // Transactions waiting in the queue now.
   long getQueueDepth() const { return newQueue ? newQueue->Size() : 0; }
@@ -81,6 +84,7 @@ class CAnalyzer {
   std::atomic<bool> shutdownRequested{false};
   std::atomic<int32_t> transactionsProcessed{0};
   std::atomic<int32_t> transactionsIgnored{0};
+  std::atomic<int64_t> transactionsTaken{0};    // analyzer thread writes, anyone reads
   std::atomic<int64_t> totalProcessingTime{0};  // ms
   int32_t oldTransactions = 0;       // restamped into this interval; analyzer thread only
   int32_t transactionsReceived = 0;  // handed to processing in this interval; analyzer thread

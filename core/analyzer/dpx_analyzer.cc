@@ -47,7 +47,8 @@ CDPXAnalyzer::Paths DefaultPaths() {
 }
 
 std::once_flag g_once;
-CDPXAnalyzer* g_instance = nullptr;  // created once, lives for the process
+CDPXAnalyzer* g_instance = nullptr;             // created once, lives for the process
+std::atomic<CDPXAnalyzer*> g_started{nullptr};  // g_instance once its thread was started
 
 }  // namespace
 
@@ -59,8 +60,15 @@ CDPXAnalyzer* CDPXAnalyzer::GetInstanceNoStart() {
 CDPXAnalyzer* CDPXAnalyzer::GetInstance() {
   static std::once_flag started;
   CDPXAnalyzer* analyzer = GetInstanceNoStart();
-  std::call_once(started, [analyzer] { analyzer->Start(); });
+  std::call_once(started, [analyzer] {
+    analyzer->Start();
+    g_started.store(analyzer);
+  });
   return analyzer;
+}
+
+CDPXAnalyzer* CDPXAnalyzer::GetInstanceIfStarted() {
+  return g_started.load();
 }
 
 void CDPXAnalyzer::setFeederFactory(FeederFactory factory) {
@@ -205,6 +213,9 @@ void CDPXAnalyzer::Run() {
       CLOG::med("Got a Transaction, Processing");
       processTransaction(*static_cast<CDPXTransaction*>(item.transaction), &lastInstanceLevel);
       delete item.transaction;
+    }
+    if (got) {
+      transactionsTaken.fetch_add(1);
     }
   }
 }

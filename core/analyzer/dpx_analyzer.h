@@ -50,6 +50,9 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // The singleton, created on first use; GetInstance also starts its thread.
   static CDPXAnalyzer* GetInstance();
   static CDPXAnalyzer* GetInstanceNoStart();
+  // The singleton once GetInstance has started it, else null; never creates it, so status
+  // requests during start-up cannot build it before its settings are read.
+  static CDPXAnalyzer* GetInstanceIfStarted();
   // Sets what creates the feeder when the thread starts (none: nothing feeds the queue but
   // add() calls). Call before the thread starts.
   static void setFeederFactory(FeederFactory factory);
