@@ -7,6 +7,7 @@
 #include <httplib.h>
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <cstdint>
 #include <cstring>
@@ -151,8 +152,10 @@ class EventsEndpointTest : public EventsTest {
 
   // Opens a stream on a thread of its own. *opened is set once the answer's status is known
   // (the subscription exists by then).
-  std::future<StreamResult> OpenStream(std::promise<int>* opened) {
-    return std::async(std::launch::async, [this, opened] {
+  // Reads the stream until it ends; *received (when given) follows the bytes received so far.
+  std::future<StreamResult> OpenStream(std::promise<int>* opened,
+                                       std::atomic<size_t>* received = nullptr) {
+    return std::async(std::launch::async, [this, opened, received] {
       auto client = Client();
       std::string body;
       int status = -1;
@@ -165,6 +168,9 @@ class EventsEndpointTest : public EventsTest {
           },
           [&](const char* data, std::size_t length) {
             body.append(data, length);
+            if (received != nullptr) {
+              received->store(body.size());
+            }
             return true;
           });
       if (status == -1) {
@@ -199,13 +205,18 @@ TEST_F(EventsEndpointTest, ListsRowsAsJsonWithLimit) {
 // A stream delivers a row pushed after it opened, and ends cleanly when the server stops.
 TEST_F(EventsEndpointTest, StreamDeliversRowsAndEndsOnStop) {
   std::promise<int> opened;
-  auto stream = OpenStream(&opened);
+  std::atomic<size_t> received{0};
+  auto stream = OpenStream(&opened, &received);
   ASSERT_EQ(200, opened.get_future().get());
   Push("NOTES", 42);
 
+  // The row reaches the client before the stop; the stop itself must not wait for the client.
+  const auto deadline = std::chrono::steady_clock::now() + 5s;
+  while (received.load() == 0 && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(10ms);
+  }
+  ASSERT_GT(received.load(), 0u);
   const auto stopping = std::chrono::steady_clock::now();
-  // Give the row time to leave before the stop; the stop itself must not wait for the client.
-  std::this_thread::sleep_for(300ms);
   server_.Stop();
   EXPECT_LT(std::chrono::steady_clock::now() - stopping, 2s);
   ASSERT_EQ(std::future_status::ready, stream.wait_for(2s));

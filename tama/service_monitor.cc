@@ -54,6 +54,7 @@ void ServiceMonitor::stopMonitoring() {
 }
 
 void ServiceMonitor::wait() {
+  polls.fetch_add(1);
   Q7_TRACE(kUnit, fw::kTraceDetail, "Waiting %d secs to poll process status",
            static_cast<int>(interval));
   wakeUp->Wait(interval * 1000);

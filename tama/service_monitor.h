@@ -40,6 +40,8 @@ class ServiceMonitor {
   void wait();
   // The pid the pid file names; 0 when there is no file or no number in it.
   long getPID() const;
+  // Polls done so far, each now followed by its pause; from any thread (tests wait on it).
+  long pollsDone() const { return polls.load(); }
 
  private:
   static void* ServiceMonitorTask(void* self);
@@ -55,6 +57,7 @@ class ServiceMonitor {
   char* const* const envp;
   const long interval;                // seconds
   std::atomic<bool> running{false};   // set by startMonitoring, cleared by stopMonitoring
+  std::atomic<long> polls{0};         // counted by the monitor thread as each pause begins
   pthread_t thread{};                 // valid once started
   bool started = false;               // owner's thread only
   std::unique_ptr<CvelEvent> wakeUp;  // manual-reset, not signalled at first

@@ -37,6 +37,14 @@ class ServiceMonitorTest : public ::testing::Test {
     }
     return log() == text;
   }
+  // Waits until the monitor has done `count` polls in all.
+  static bool waitForPolls(const ServiceMonitor& m, long count, std::chrono::milliseconds timeout) {
+    const auto deadline = Clock::now() + timeout;
+    while (m.pollsDone() < count && Clock::now() < deadline) {
+      std::this_thread::sleep_for(10ms);
+    }
+    return m.pollsDone() >= count;
+  }
   std::unique_ptr<ServiceMonitor> monitor(long interval) {
     return std::make_unique<ServiceMonitor>(pidFile_.c_str(), "/bin/sh", startArgv_, "/bin/sh",
                                             stopArgv_, envp_, interval);
@@ -72,7 +80,7 @@ TEST_F(ServiceMonitorTest, DeadPidIsRestartedAtTheNextPoll) {
   auto m = monitor(1);
   m->startMonitoring();
   EXPECT_TRUE(waitForLog("start\n", 2s)) << log();
-  std::this_thread::sleep_for(1500ms);
+  ASSERT_TRUE(waitForPolls(*m, m->pollsDone() + 2, 5s));
   EXPECT_EQ("start\n", log());  // alive: polls start nothing
   writePid(deadPid());
   EXPECT_TRUE(waitForLog("start\nstart\n", 3s)) << log();
@@ -87,7 +95,7 @@ TEST_F(ServiceMonitorTest, StopDuringAPauseReturnsAtOnce) {
   writePid(getpid());
   auto m = monitor(60);
   m->startMonitoring();
-  std::this_thread::sleep_for(300ms);
+  ASSERT_TRUE(waitForPolls(*m, 1, 5s));  // in its first pause
   const auto asked = Clock::now();
   m->stopMonitoring();
   EXPECT_LT(Clock::now() - asked, 5s);
@@ -111,7 +119,7 @@ TEST_F(ServiceMonitorTest, StopDuringTheStartCommandEndsAfterIt) {
   writeScript("sleep 1");
   auto m = monitor(60);
   m->startMonitoring();
-  std::this_thread::sleep_for(300ms);
+  ASSERT_TRUE(waitForLog("start\n", 2s));  // the start command runs
   const auto asked = Clock::now();
   m->stopMonitoring();
   const auto took = Clock::now() - asked;

@@ -106,21 +106,25 @@ TEST_F(IntakeE2ETest, EveryPageCountedOnceAcrossRenamesRolloversAndRestarts) {
   write("day2.sm3", 50);
   expectTablesMatchTruth(address, 20s);
 
-  // Stop the agent while the collector keeps writing; write more while it is down.
-  std::atomic<bool> writing{true};
+  // Stop the agent while the collector keeps writing: batches go on from before the SIGTERM
+  // until after the agent has exited (12 at least); then more while it is down.
+  std::atomic<int> batches{0};
+  std::atomic<bool> agentGone{false};
   std::thread writer([&] {
-    for (int i = 0; i < 12; ++i) {
+    bool afterExit = false;
+    while (!afterExit || batches.load() < 12) {
+      afterExit = agentGone.load();
       write("day2.sm3", 150);
-      std::this_thread::sleep_for(40ms);
+      ++batches;
     }
-    writing = false;
   });
-  std::this_thread::sleep_for(150ms);
+  EXPECT_TRUE(
+      waitFor([&] { return batches.load() >= 2; }, 20s));  // no ASSERT: the thread must be joined
   agent_->signal(SIGTERM);
   const auto exited = agent_->wait(10s);
-  ASSERT_TRUE(exited.has_value());
-  EXPECT_TRUE(writing.load()) << "the stop should come in the middle of writing";
+  agentGone = true;
   writer.join();
+  ASSERT_TRUE(exited.has_value());
   write("day2.sm3", 100);
 
   // The paths this test is about were really taken.
