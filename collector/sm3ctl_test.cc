@@ -87,8 +87,15 @@ bool WaitFor(const std::function<bool()>& done, std::chrono::milliseconds limit)
 
 // A live process, zombies excluded (nobody may reap the orphaned collector processes here).
 bool Running(long pid) {
-  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
-  std::string stat((std::istreambuf_iterator<char>(in)), {});
+  // read(2) rather than a stream: a process that ends between open and read makes the read
+  // fail with ESRCH, which libstdc++'s stream buffer turns into an exception.
+  std::string stat(512, '\0');
+  const int fd = ::open(("/proc/" + std::to_string(pid) + "/stat").c_str(), O_RDONLY | O_CLOEXEC);
+  const ssize_t got = fd < 0 ? -1 : ::read(fd, stat.data(), stat.size());
+  if (fd >= 0) {
+    ::close(fd);
+  }
+  stat.resize(got > 0 ? static_cast<size_t>(got) : 0);
   const size_t paren = stat.rfind(')');
   return paren != std::string::npos && paren + 2 < stat.size() && stat[paren + 2] != 'Z';
 }
