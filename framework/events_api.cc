@@ -3,6 +3,7 @@
 #include <httplib.h>
 
 #include <chrono>
+#include <condition_variable>
 #include <cstddef>
 #include <map>
 #include <memory>
@@ -32,9 +33,13 @@ constexpr auto kStreamPoll = 200ms;
 // A comment line this often finds clients that went away while no rows came.
 constexpr auto kStreamHeartbeat = 15s;
 
+// How long a stop waits for open streams to write their end before the server closes sockets.
+constexpr auto kStreamEndWait = 1s;
+
 // The streams of one server.
 struct StreamControl {
-  std::mutex mutex;  // guards everything below
+  std::mutex mutex;               // guards everything below
+  std::condition_variable ended;  // notified when a stream goes away
   bool ending = false;
   int open = 0;
   std::vector<std::weak_ptr<EventSubscription>> subscriptions;
@@ -143,8 +148,11 @@ void ServeStream(const std::shared_ptr<StreamControl>& control, httplib::Respons
       // Runs when the response goes away, however the stream ended.
       [control, subscription](bool /*success*/) {
         subscription->Close();
-        std::lock_guard<std::mutex> lock(control->mutex);
-        --control->open;
+        {
+          std::lock_guard<std::mutex> lock(control->mutex);
+          --control->open;
+        }
+        control->ended.notify_all();
         Q7_TRACE(kUnit, kTraceDetail, "event stream closed");
       });
 }
@@ -176,7 +184,7 @@ void EndEventStreams(httplib::Server& server) {
     control = std::move(it->second);
     controls.by_server.erase(it);
   }
-  std::lock_guard<std::mutex> lock(control->mutex);
+  std::unique_lock<std::mutex> lock(control->mutex);
   control->ending = true;
   for (const auto& weak : control->subscriptions) {
     if (auto subscription = weak.lock()) {
@@ -184,6 +192,10 @@ void EndEventStreams(httplib::Server& server) {
     }
   }
   control->subscriptions.clear();
+  // Each stream, woken by its closed subscription, writes the end of its chunked reply; the
+  // server's stop would otherwise shut the socket under a stream about to end cleanly. A client
+  // that does not read is not waited for beyond the bound.
+  control->ended.wait_for(lock, kStreamEndWait, [&control] { return control->open == 0; });
 }
 
 }  // namespace fw

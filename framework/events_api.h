@@ -23,8 +23,10 @@ inline constexpr int kMaxEventStreams = 4;
 // Adds the routes to *server; *server must outlive its listening.
 void InstallEventRoutes(httplib::Server& server);
 
-// Ends the open streams of *server within a fraction of a second and refuses new ones. Call it
-// before server.stop(), which otherwise waits forever for the streams' worker threads.
+// Ends the open streams of *server and refuses new ones: each writes the end of its reply, and
+// the call returns once they have (at most about a second, for clients that do not read). Call
+// it before server.stop(), which otherwise waits forever for the streams' worker threads, and
+// would cut a stream short of its end.
 void EndEventStreams(httplib::Server& server);
 
 }  // namespace fw
