@@ -13,6 +13,7 @@
 
 #include "core/analyzer/dpx_analyzer.h"
 #include "core/analyzer/dpx_transaction.h"
+#include "core/analyzer/testing/transaction_builder.h"
 #include "framework/trace.h"
 
 namespace {
@@ -34,18 +35,14 @@ std::unique_ptr<CDPXAnalyzer> NewAnalyzer(const TempDir& dir) {
 }
 
 CDPXTransaction Page(const std::string& host, const std::string& url, const char* client) {
-  SM3_HPAGE_ENTRY e{};
-  e.iTransTime = static_cast<int32_t>(time(nullptr));
-  e.iTotalResponseTime = 180;
-  e.iServerTime = 60;
-  e.iRequestStatus = 200;
-  snprintf(e.szURLHostName, sizeof(e.szURLHostName), "%s", host.c_str());
-  snprintf(e.szURL, sizeof(e.szURL), "%s", url.c_str());
-  snprintf(e.szIPSourceAddress, sizeof(e.szIPSourceAddress), "%s", client);
-  snprintf(e.szIPDestinationAddress, sizeof(e.szIPDestinationAddress), "192.0.2.10");
-  CDPXTransaction t(e);
-  t.setRecordType(1);
-  return t;
+  return TransactionBuilder()
+      .host(host)
+      .url(url)
+      .client(client)
+      .time(time(nullptr))
+      .responseTime(180)
+      .serverTime(60)
+      .build();
 }
 
 long ResidentBytes() {

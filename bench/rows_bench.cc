@@ -7,23 +7,19 @@
 #include <cstdio>
 
 #include "core/analyzer/rows/rows.h"
+#include "core/analyzer/testing/transaction_builder.h"
 
 namespace {
 
 CDPXTransaction Transaction() {
-  SM3_HPAGE_ENTRY e{};
-  e.iTotalResponseTime = 230;
-  e.iServerTime = 80;
-  e.iNetworkTime = 40;
-  e.iRequestStatus = 200;
-  e.iLoadTime = 120;
-  snprintf(e.szURLHostName, sizeof(e.szURLHostName), "www.shop.example");
-  snprintf(e.szURL, sizeof(e.szURL), "/shop/catalog/items/index.jsp");
-  snprintf(e.szIPSourceAddress, sizeof(e.szIPSourceAddress), "10.1.2.3");
-  snprintf(e.szIPDestinationAddress, sizeof(e.szIPDestinationAddress), "192.0.2.10");
-  CDPXTransaction t(e);
-  t.setMinThreshold(500);
-  return t;
+  return TransactionBuilder()
+      .url("/shop/catalog/items/index.jsp")
+      .responseTime(230)
+      .serverTime(80)
+      .networkTime(40)
+      .loadTime(120)
+      .minThreshold(500)
+      .build();
 }
 
 void BM_RowUpdate(benchmark::State& state) {

@@ -18,6 +18,7 @@
 
 #include "core/analyzer/dpx_analyzer.h"
 #include "core/analyzer/dpx_transaction.h"
+#include "core/analyzer/testing/transaction_builder.h"
 #include "core/history/history_store.h"
 #include "framework/clock.h"
 #include "framework/http_server.h"
@@ -33,18 +34,15 @@ constexpr int kRowsPerInterval = 100;  // 28 800 in all: over MAX_ROWS
 constexpr int kCalls = 200;
 
 CDPXTransaction Page(int key) {
-  SM3_HPAGE_ENTRY e{};
-  e.iTransTime = static_cast<int32_t>(time(nullptr));
-  e.iTotalResponseTime = 100 + key % 400;
-  e.iServerTime = 40;
-  e.iRequestStatus = key % 50 == 0 ? 500 : 200;
-  snprintf(e.szURLHostName, sizeof(e.szURLHostName), "site%d.example", key % 20);
-  snprintf(e.szURL, sizeof(e.szURL), "/shop/item/%d", key);
-  snprintf(e.szIPSourceAddress, sizeof(e.szIPSourceAddress), "10.1.%d.%d", key % 7, key % 11);
-  snprintf(e.szIPDestinationAddress, sizeof(e.szIPDestinationAddress), "192.0.2.10");
-  CDPXTransaction t(e);
-  t.setRecordType(1);
-  return t;
+  return TransactionBuilder()
+      .host("site" + std::to_string(key % 20) + ".example")
+      .url("/shop/item/" + std::to_string(key))
+      .client("10.1." + std::to_string(key % 7) + "." + std::to_string(key % 11))
+      .time(time(nullptr))
+      .responseTime(100 + key % 400)
+      .serverTime(40)
+      .status(key % 50 == 0 ? 500 : 200)
+      .build();
 }
 
 }  // namespace

@@ -16,6 +16,7 @@
 #include "core/analyzer/dpx_analyzer.h"
 #include "core/analyzer/dpx_transaction.h"
 #include "core/analyzer/rows/rows.h"
+#include "core/analyzer/testing/transaction_builder.h"
 #include "framework/clock.h"
 #include "tama/cconfig.h"
 #include "tests/support/scratch_dir.h"
@@ -54,26 +55,24 @@ class AnalyzerFixture : public ::testing::Test {
   // A page (or, with a parent, an object) of app/url from client at time t.
   CDPXTransaction Page(const char* app, const char* url, int rt = 100, int status = 200,
                        const char* client = "10.1.2.3", long t = 0) {
-    SM3_HPAGE_ENTRY e{};
-    e.iTransTime = static_cast<int32_t>(t != 0 ? t : now_.load());
-    e.iTotalResponseTime = rt;
-    e.iRequestStatus = status;
-    snprintf(e.szURLHostName, sizeof(e.szURLHostName), "%s", app);
-    snprintf(e.szURL, sizeof(e.szURL), "%s", url);
-    snprintf(e.szIPSourceAddress, sizeof(e.szIPSourceAddress), "%s", client);
-    snprintf(e.szIPDestinationAddress, sizeof(e.szIPDestinationAddress), "192.0.2.10");
-    CDPXTransaction tx(e);
-    tx.setRecordType(1);
-    return tx;
+    return TransactionBuilder()
+        .host(app)
+        .url(url)
+        .responseTime(rt)
+        .status(status)
+        .client(client)
+        .time(t != 0 ? t : now_.load())
+        .build();
   }
   CDPXTransaction Object(const char* app, const char* url, int status = 200) {
-    CDPXTransaction tx = Page(app, url, 50, status);
-    tx.setRecordType(2);
-    tx.setParentUUID(std::string(32, 'A').c_str());
-    tx.setRootUUID(std::string(32, 'A').c_str());
-    tx.setCurrentUUID(std::string(32, 'B').c_str());
-    tx.setControlFlags(1);
-    return tx;
+    return TransactionBuilder()
+        .host(app)
+        .url(url)
+        .responseTime(50)
+        .status(status)
+        .time(now_.load())
+        .objectOf(std::string(32, 'A'), std::string(32, 'A'), std::string(32, 'B'))
+        .build();
   }
   void Process(CDPXTransaction tx) { analyzer_->processTransaction(tx, &level_); }
 

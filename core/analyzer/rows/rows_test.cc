@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "core/analyzer/other_transactions.h"
+#include "core/analyzer/testing/transaction_builder.h"
 #include "framework/clock.h"
 #include "framework/trace_capture.h"
 #include "tama/cconfig.h"
@@ -17,20 +18,16 @@ namespace {
 
 // A web transaction with the given response time, server time and status.
 CDPXTransaction Tx(int rt, int status = 200, int server = 0, int network = 0) {
-  SM3_HPAGE_ENTRY e{};
-  e.iTotalResponseTime = rt;
-  e.iRequestStatus = status;
-  e.iServerTime = server;
-  e.iNetworkTime = network;
-  e.iLoadTime = rt * 2;
-  e.iTotalBytes = 1000;
-  snprintf(e.szURLHostName, sizeof(e.szURLHostName), "www.shop.example");
-  snprintf(e.szURL, sizeof(e.szURL), "/cart");
-  snprintf(e.szIPSourceAddress, sizeof(e.szIPSourceAddress), "10.1.2.3");
-  snprintf(e.szIPDestinationAddress, sizeof(e.szIPDestinationAddress), "192.0.2.10");
-  CDPXTransaction t(e);
-  t.setMinThreshold(500);
-  return t;
+  return TransactionBuilder()
+      .url("/cart")
+      .responseTime(rt)
+      .status(status)
+      .serverTime(server)
+      .networkTime(network)
+      .loadTime(rt * 2)
+      .totalBytes(1000)
+      .minThreshold(500)
+      .build();
 }
 
 class RowTest : public ::testing::Test {
