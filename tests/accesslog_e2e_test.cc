@@ -154,18 +154,6 @@ class AccesslogE2ETest : public AgentE2ETest {
     ASSERT_TRUE(nginx_->Start(locations, &error)) << error;
   }
 
-  void TearDown() override {
-    const std::string ctl = base() + "dpx/sm3ctl";
-    if (!superviseCollector_ || !std::filesystem::exists(ctl)) {
-      return;
-    }
-    agent_.reset();
-    for (const char* target : {"collector", "analyzer"}) {
-      RunToEnd({"/bin/sh", ctl, "stop", target}, lab_.file("stop.out"), lab_.file("stop.out"),
-               nullptr, nullptr);
-    }
-  }
-
   // Runs curl's transfers (each a session of its own) and waits until nginx has logged them:
   // nginx writes a line once the reply is sent, which may be just after curl has it.
   void Browse(const std::vector<std::vector<CurlTransfer>>& sessions) {
@@ -307,18 +295,12 @@ TEST_F(AccesslogE2ETest, ReadsNginxLogExactly) {
 TEST_F(AccesslogE2ETest, SupervisedFollowsLogAcrossRestart) {
   const std::string data = useDataDirectory();
   const std::string dpx = base() + "dpx/";
-  std::filesystem::create_directories(dpx + "linux");
-  std::filesystem::copy_file(SM3CTL_PATH, dpx + "sm3ctl");
-  std::filesystem::permissions(dpx + "sm3ctl", std::filesystem::perms::owner_all,
-                               std::filesystem::perm_options::add);
-  std::ofstream(dpx + "sm3ctl.conf")
-      << "MODE=accesslog\nLOG_PATH=" << nginx_->timed_log_path()
-      << "\nFORMAT=nginx-timed\nLOGS_OPTIONS='--host " << kSiteHost
-      << " --server-address 127.0.0.1'\nDATA_DIR=" << data
-      << "\nSTEM=weblog\nBIN_DIR=" << std::filesystem::path(SM3LOGS_PATH).parent_path().string()
-      << "\n";
+  superviseCollectorWith("MODE=accesslog\nLOG_PATH=" + nginx_->timed_log_path() +
+                         "\nFORMAT=nginx-timed\nLOGS_OPTIONS='--host " + kSiteHost +
+                         " --server-address 127.0.0.1'\nDATA_DIR=" + data +
+                         "\nSTEM=weblog\nBIN_DIR=" +
+                         std::filesystem::path(SM3LOGS_PATH).parent_path().string() + "\n");
   registerCatchAllPattern();
-  superviseCollector_ = true;
 
   struct utsname names {};
   uname(&names);

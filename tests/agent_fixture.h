@@ -10,7 +10,9 @@
 
 #include <chrono>
 #include <cstdio>
+#include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <map>
 #include <memory>
 #include <nlohmann/json.hpp>
@@ -77,6 +79,32 @@ class AgentE2ETest : public ::testing::Test {
       sum += row["totreq"].get<long>();
     }
     return sum;
+  }
+
+  // Installs the collector control script in the agent's home with `conf` as its sm3ctl.conf,
+  // and has the agent supervise the collector processes from its next start.
+  void superviseCollectorWith(const std::string& conf) {
+    const std::string dpx = base() + "dpx/";
+    std::filesystem::create_directories(dpx + "linux");
+    std::filesystem::copy_file(SM3CTL_PATH, dpx + "sm3ctl");
+    std::filesystem::permissions(dpx + "sm3ctl", std::filesystem::perms::owner_all,
+                                 std::filesystem::perm_options::add);
+    std::ofstream(dpx + "sm3ctl.conf") << conf;
+    superviseCollector_ = true;
+  }
+
+  // A failed supervised test leaves no collector process behind: the agent would have stopped
+  // them, and they run in sessions of their own.
+  void TearDown() override {
+    const std::string ctl = base() + "dpx/sm3ctl";
+    if (!superviseCollector_ || !std::filesystem::exists(ctl)) {
+      return;
+    }
+    agent_.reset();
+    for (const char* target : {"collector", "analyzer"}) {
+      const std::string command = "/bin/sh " + ctl + " stop " + target + " >/dev/null 2>&1";
+      EXPECT_NE(-1, std::system(command.c_str()));
+    }
   }
 
   // Starts the agent and waits until its API answers; returns the bound address.

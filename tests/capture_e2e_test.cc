@@ -164,20 +164,6 @@ class CaptureE2ETest : public AgentE2ETest {
     return records;
   }
 
-  // A failed supervised test leaves no collector process behind: the agent would have stopped
-  // them, and they run in sessions of their own.
-  void TearDown() override {
-    const std::string ctl = base() + "dpx/sm3ctl";
-    if (!superviseCollector_ || !std::filesystem::exists(ctl)) {
-      return;
-    }
-    agent_.reset();
-    for (const char* target : {"collector", "analyzer"}) {
-      RunToEnd({"/bin/sh", ctl, "stop", target}, lab_.file("stop.out"), lab_.file("stop.out"),
-               nullptr, nullptr);
-    }
-  }
-
   std::unique_ptr<PythonUpstream> upstream_;
   std::unique_ptr<NginxServer> nginx_;
   ScratchDir lab_;
@@ -395,17 +381,12 @@ TEST_F(CaptureE2ETest, RecordedRealTraffic) {
 TEST_F(CaptureE2ETest, SupervisedOnLoopback) {
   const std::string data = useDataDirectory();
   const std::string dpx = base() + "dpx/";
-  std::filesystem::create_directories(dpx + "linux");
-  std::filesystem::copy_file(SM3CTL_PATH, dpx + "sm3ctl");
-  std::filesystem::permissions(dpx + "sm3ctl", std::filesystem::perms::owner_all,
-                               std::filesystem::perm_options::add);
   // The filter holds blanks and quotes, as an operator writes it.
-  std::ofstream(dpx + "sm3ctl.conf")
-      << "MODE=capture\nINTERFACE=lo\nFILTER='tcp port " << nginx_->port() << "'\nDATA_DIR=" << data
-      << "\nSTEM=traffic\nBIN_DIR=" << std::filesystem::path(SM3CAPTURE_PATH).parent_path().string()
-      << "\n";
+  superviseCollectorWith("MODE=capture\nINTERFACE=lo\nFILTER='tcp port " +
+                         std::to_string(nginx_->port()) + "'\nDATA_DIR=" + data +
+                         "\nSTEM=traffic\nBIN_DIR=" +
+                         std::filesystem::path(SM3CAPTURE_PATH).parent_path().string() + "\n");
   registerCatchAllPattern();
-  superviseCollector_ = true;
   const std::string address = start();
 
   // The capture process keeps its pid file from the moment it captures.

@@ -28,16 +28,12 @@ class CollectorE2ETest : public AgentE2ETest {
  protected:
   // Lays out <base>/dpx/ as an installation does: sm3ctl, its configuration and linux/.
   void installCollector(const std::string& data) {
-    const std::string dpx = base() + "dpx/";
-    std::filesystem::create_directories(dpx + "linux");
-    std::filesystem::copy_file(SM3CTL_PATH, dpx + "sm3ctl");
-    std::filesystem::permissions(dpx + "sm3ctl", std::filesystem::perms::owner_all,
-                                 std::filesystem::perm_options::add);
-    const std::string bin = std::filesystem::path(SM3GEN_PATH).parent_path().string();
-    std::ofstream(dpx + "sm3ctl.conf")
-        << "MODE=simulate\nDATA_DIR=" << data << "\nRATE=2000\nSTEM=traffic\nROLL_BYTES=3000000\n"
-        << "ROLL_SECONDS=3600\nBIN_DIR=" << bin << "\nTRUTH_DIR=" << truthDir() << "\nSEED=11\n";
     std::filesystem::create_directories(truthDir());
+    superviseCollectorWith(
+        "MODE=simulate\nDATA_DIR=" + data +
+        "\nRATE=2000\nSTEM=traffic\nROLL_BYTES=3000000\nROLL_SECONDS=3600\nBIN_DIR=" +
+        std::filesystem::path(SM3GEN_PATH).parent_path().string() + "\nTRUTH_DIR=" + truthDir() +
+        "\nSEED=11\n");
   }
   std::string truthDir() const { return home_.path() + "truth"; }
   // Pid files are named after the node name's first 24 characters, dots kept.
@@ -52,7 +48,6 @@ TEST_F(CollectorE2ETest, SimulatedTrafficAcrossRolloversCountedExactly) {
   const std::string data = useDataDirectory();
   installCollector(data);
   registerCatchAllPattern();
-  superviseCollector_ = true;
   const std::string address = start();
 
   // Both processes run, named by their pid files.
