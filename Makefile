@@ -52,12 +52,14 @@ test: build
 	$(MAKE) --no-print-directory test-tsan
 
 asan: deps
-	cmake -S . -B build-asan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_SANITIZE=ON
+	cmake -S . -B build-asan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_SANITIZE=ON \
+	  -DQ7_BUILD_E2E=OFF -DQ7_BUILD_BENCH=OFF
 	cmake --build build-asan -j $(JOBS)
 	cd build-asan && ctest --output-on-failure -j $(JOBS) -L unit --timeout 300
 
 tsan: deps
-	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON
+	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON \
+	  -DQ7_BUILD_E2E=OFF -DQ7_BUILD_BENCH=OFF
 	cmake --build build-tsan -j $(JOBS)
 	cd build-tsan && ctest --output-on-failure -j $(JOBS) -L unit --timeout 300
 
@@ -66,7 +68,8 @@ tsan: deps
 # intake threads (data file monitors and the file manager), the framework's event rings,
 # event streams and situations, and the collector process monitors.
 test-tsan: deps
-	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON
+	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON \
+	  -DQ7_BUILD_E2E=OFF -DQ7_BUILD_BENCH=OFF
 	cmake --build build-tsan -j $(JOBS) --target runtime_test analyzer_test framework_test tama_test
 	build-tsan/bin/runtime_test --gtest_brief=1
 	build-tsan/bin/tama_test --gtest_brief=1 --gtest_filter='ServiceMonitor*'
