@@ -23,6 +23,7 @@
 #include "framework/http_server.h"
 #include "framework/status.h"
 #include "framework/tables.h"
+#include "tests/support/test_util.h"
 
 namespace fw {
 namespace {
@@ -211,11 +212,7 @@ TEST_F(EventsEndpointTest, StreamDeliversRowsAndEndsOnStop) {
   Push("NOTES", 42);
 
   // The row reaches the client before the stop; the stop itself must not wait for the client.
-  const auto deadline = std::chrono::steady_clock::now() + 5s;
-  while (received.load() == 0 && std::chrono::steady_clock::now() < deadline) {
-    std::this_thread::sleep_for(10ms);
-  }
-  ASSERT_GT(received.load(), 0u);
+  ASSERT_TRUE(q7test::PollUntil([&] { return received.load() > 0; }, 5s));
   const auto stopping = std::chrono::steady_clock::now();
   server_.Stop();
   EXPECT_LT(std::chrono::steady_clock::now() - stopping, 2s);

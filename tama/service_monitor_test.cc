@@ -13,6 +13,7 @@
 #include <thread>
 
 #include "tests/support/scratch_dir.h"
+#include "tests/support/test_util.h"
 
 namespace {
 
@@ -39,11 +40,7 @@ class ServiceMonitorTest : public ::testing::Test {
   }
   // Waits until the monitor has done `count` polls in all.
   static bool waitForPolls(const ServiceMonitor& m, long count, std::chrono::milliseconds timeout) {
-    const auto deadline = Clock::now() + timeout;
-    while (m.pollsDone() < count && Clock::now() < deadline) {
-      std::this_thread::sleep_for(10ms);
-    }
-    return m.pollsDone() >= count;
+    return q7test::PollUntil([&] { return m.pollsDone() >= count; }, timeout);
   }
   std::unique_ptr<ServiceMonitor> monitor(long interval) {
     return std::make_unique<ServiceMonitor>(pidFile_.c_str(), "/bin/sh", startArgv_, "/bin/sh",
