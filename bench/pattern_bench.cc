@@ -3,8 +3,8 @@
 
 #include <benchmark/benchmark.h>
 
-#include "core/analyzer/common.h"
-#include "core/analyzer/pattern_match_internal.h"
+#include "core/analyzer/intake/common.h"
+#include "core/analyzer/intake/pattern_match_internal.h"
 
 namespace {
 

@@ -12,7 +12,7 @@
 #include <vector>
 
 #include "core/analyzer/dpx_analyzer.h"
-#include "core/analyzer/dpx_transaction.h"
+#include "core/analyzer/intake/dpx_transaction.h"
 #include "core/analyzer/testing/transaction_builder.h"
 #include "framework/trace.h"
 

@@ -28,9 +28,9 @@
 
 #include "collector/sm3gen/file_mode.h"
 #include "core/analyzer/dpx_analyzer.h"
-#include "core/analyzer/dpx_data_file_monitor.h"
+#include "core/analyzer/intake/dpx_data_file_monitor.h"
+#include "core/config/cconfig.h"
 #include "framework/trace.h"
-#include "tama/cconfig.h"
 
 namespace {
 
@@ -205,7 +205,7 @@ int main(int argc, char** argv) {
 
   CDPXDataFileMonitor monitor(file.c_str(), 0);
   monitor.setStatic();
-  monitor.setAnalyzer(&analyzer);
+  monitor.setSink(&analyzer);
   const auto started = Clock::now();
   monitor.Start();
   std::map<std::string, double> cpu;

@@ -17,7 +17,7 @@
 #include <vector>
 
 #include "core/analyzer/dpx_analyzer.h"
-#include "core/analyzer/dpx_transaction.h"
+#include "core/analyzer/intake/dpx_transaction.h"
 #include "core/analyzer/testing/transaction_builder.h"
 #include "core/history/history_store.h"
 #include "framework/clock.h"

@@ -6,9 +6,9 @@
 
 #include <string>
 
-#include "core/analyzer/sm3_framing.h"
-#include "core/analyzer/sm3_parser.h"
-#include "core/analyzer/transaction_identity.h"
+#include "core/analyzer/intake/sm3_framing.h"
+#include "core/analyzer/intake/sm3_parser.h"
+#include "core/analyzer/intake/transaction_identity.h"
 #include "tests/support/sm3_lines.h"
 
 namespace {

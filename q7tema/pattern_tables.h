@@ -15,8 +15,8 @@
 #include <cstdint>
 #include <functional>
 
+#include "core/layouts/table_layouts.h"
 #include "q7tema/table_agent.h"
-#include "q7tema/table_layouts.h"
 
 namespace q7tema {
 

@@ -14,8 +14,8 @@
 #include <cstddef>
 #include <string_view>
 
+#include "core/layouts/table_layouts.h"
 #include "framework/tables.h"
-#include "q7tema/table_layouts.h"
 
 namespace q7tema {
 

@@ -6,13 +6,13 @@
 #include <limits>
 #include <string>
 
+#include "core/config/cconfig.h"
 #include "framework/config_file.h"
 #include "framework/environment.h"
 #include "framework/status.h"
 #include "framework/trace.h"
 #include "tama/agent_globals.h"
 #include "tama/agent_properties.h"
-#include "tama/cconfig.h"
 
 namespace {
 

@@ -10,10 +10,10 @@
 #include <string>
 #include <vector>
 
+#include "core/config/cconfig.h"
 #include "framework/trace_capture.h"
 #include "tama/agent_globals.h"
 #include "tama/agent_properties.h"
-#include "tama/cconfig.h"
 #include "tests/support/scratch_dir.h"
 
 namespace {

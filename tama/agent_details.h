@@ -2,7 +2,7 @@
 
 // The agent-details table (Q7AGNTDTS): one row per agent property, as a sample sees them.
 
-#include "q7tema/table_layouts.h"
+#include "core/layouts/table_layouts.h"
 
 // A new[] array of one row per agent property, or null with count 0 when there are none or the
 // sample type is not 3. timestamp and sampletime are the sample time.

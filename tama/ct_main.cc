@@ -4,11 +4,11 @@
 #include <memory>
 #include <string>
 
+#include "core/config/cconfig.h"
 #include "framework/agent_runtime.h"
 #include "framework/trace.h"
 #include "tama/agent_globals.h"
 #include "tama/agent_hooks.h"
-#include "tama/cconfig.h"
 #include "tama/signal_manager.h"
 #include "tama/startup.h"
 

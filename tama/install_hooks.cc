@@ -3,13 +3,12 @@
 #include <nlohmann/json.hpp>
 
 #include "core/analyzer/dpx_analyzer.h"
-#include "core/analyzer/dpx_file_manager.h"
+#include "core/messages/agent_message.h"
 #include "q7tema/pattern_tables.h"
 #include "q7tema/row_query.h"
 #include "tama/agent_config.h"
 #include "tama/agent_details.h"
 #include "tama/agent_hooks.h"
-#include "tama/agent_message.h"
 #include "tama/service_monitor.h"
 
 namespace tama {
@@ -17,16 +16,17 @@ namespace tama {
 namespace {
 
 // The exported row tables the analyzer answers.
-#define Q7_ANALYZER_ROW_TABLES(X)                                                           \
-  X(appot)                                                                                  \
-  X(appsm)                                                                                  \
-  X(clntapp)                                                                                \
-  X(clntot)                                                                                 \
-  X(clntsm)                                                                                 \
-  X(clntsrv)                                                                                \
-  X(srvappsm)                                                                               \
-  X(srvot) X(srvsm) X(txins) X(txot) X(txsm) X(txcs) X(appcs) X(clntcs) X(srvcs) X(subtxsm) \
-      X(subtxot) X(subtxins)
+#define Q7_ANALYZER_ROW_TABLES(X)                                                             \
+  X(appot)                                                                                    \
+  X(appsm)                                                                                    \
+  X(clntapp)                                                                                  \
+  X(clntot)                                                                                   \
+  X(clntsm)                                                                                   \
+  X(clntsrv)                                                                                  \
+  X(srvappsm)                                                                                 \
+  X(srvot)                                                                                    \
+  X(srvsm) X(txins) X(txot) X(txsm) X(txcs) X(appcs) X(clntcs) X(srvcs) X(subtxsm) X(subtxot) \
+      X(subtxins)
 
 void installRowQueries() {
 #define Q7_ROW_QUERY(name)                                                       \
@@ -116,12 +116,6 @@ void installAgentHooks() {
   setResourceBundleHook(&AgentMessage::setResourceBundle);
   installRowQueries();
   installPatternHooks();
-  // The file manager tails the collector's data directory for the analyzer.
-  CDPXAnalyzer::setFeederFactory([](const char* dataDirectory) {
-    auto manager = std::make_unique<CDPXFileManager>();
-    manager->setDirToWatch(dataDirectory);
-    return std::unique_ptr<CAnalyzerFeeder>(std::move(manager));
-  });
 }
 
 }  // namespace tama

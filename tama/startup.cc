@@ -18,7 +18,7 @@
 #include "tama/agent_globals.h"
 #include "tama/agent_hooks.h"
 #include "tama/agent_properties.h"
-#include "tama/cconfig.h"
+#include "core/config/cconfig.h"
 
 namespace {
 

@@ -10,8 +10,8 @@
 #include <nlohmann/json.hpp>
 #include <string>
 
-#include "core/analyzer/sm3_framing.h"
-#include "core/analyzer/sm3_parser.h"
+#include "core/analyzer/intake/sm3_framing.h"
+#include "core/analyzer/intake/sm3_parser.h"
 #include "framework/trace.h"
 #include "tests/support/scratch_dir.h"
 

@@ -4,13 +4,13 @@
 #include <memory>
 #include <utility>
 
+#include "core/analyzer/intake/transaction.h"
 #include "core/analyzer/situation_controller.h"
-#include "core/analyzer/transaction.h"
+#include "core/config/cconfig.h"
+#include "core/messages/agent_message.h"
 #include "core/runtime/clog.h"
 #include "core/runtime/misc.h"
 #include "framework/clock.h"
-#include "tama/agent_message.h"
-#include "tama/cconfig.h"
 
 namespace {
 

@@ -12,32 +12,29 @@
 #include <cstdint>
 #include <memory>
 
-#include "core/analyzer/intake_counters.h"
+#include "core/analyzer/intake/intake_counters.h"
+#include "core/analyzer/intake/transaction_sink.h"
 #include "core/runtime/tvel_queue.h"
 #include "core/runtime/typed_transaction.h"
 
 class CSituationController;
 
-// Kinds of queued transaction records.
-inline constexpr uint32_t TRANSACTION_KIND_DPX = 5;
-inline constexpr uint32_t TRANSACTION_KIND_SUBTX = 6;
-
-class CAnalyzer {
+class CAnalyzer : public TransactionSink {
  public:
   // patternDirectory: where the pattern files live (the historical data directory).
   explicit CAnalyzer(const char* patternDirectory);
-  virtual ~CAnalyzer();
+  ~CAnalyzer() override;
   CAnalyzer(const CAnalyzer&) = delete;
   CAnalyzer& operator=(const CAnalyzer&) = delete;
 
   // Queues item; the analyzer owns its transaction from then on. False when the queue refused
   // it (the transaction is then deleted) or did not exist (the transaction stays the caller's).
-  bool add(_TYPED_TRANSACTION item);
+  bool add(_TYPED_TRANSACTION item) override;
 
   // Asks the analyzer thread to finish. Besides setting the flag its loop polls, it queues an
   // empty item so that a thread waiting on an idle queue notices at once.
   void Shutdown();
-  bool isShutdownRequested() const { return shutdownRequested.load(); }
+  bool isShutdownRequested() const override { return shutdownRequested.load(); }
 
   int getCurrentOverTimeInterval() const { return currentOverTimeInterval.load(); }
   void setCurrentOverTimeInterval(int interval) { currentOverTimeInterval.store(interval); }
@@ -67,7 +64,7 @@ class CAnalyzer {
   CSituationController& situations() { return *situationController; }
 
   // What the data file monitors read; they write it, anyone reads it.
-  IntakeCounters& intakeCounters() { return intake; }
+  IntakeCounters& intakeCounters() override { return intake; }
   const IntakeCounters& intakeCounters() const { return intake; }
 
   int32_t getTransactionsProcessed() const { return transactionsProcessed.load(); }

@@ -6,7 +6,7 @@
 #include <string>
 
 #include "core/analyzer/dpx_analyzer.h"
-#include "core/analyzer/linked_list.h"
+#include "core/analyzer/intake/linked_list.h"
 #include "framework/trace_capture.h"
 #include "tests/support/scratch_dir.h"
 

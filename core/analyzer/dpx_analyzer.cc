@@ -6,16 +6,17 @@
 #include <string>
 #include <thread>
 
-#include "core/analyzer/dpx_transaction.h"
+#include "core/analyzer/intake/dpx_file_manager.h"
+#include "core/analyzer/intake/dpx_transaction.h"
 #include "core/analyzer/situation_controller.h"
+#include "core/config/cconfig.h"
 #include "core/history/history_store.h"
 #include "core/history/instance_file.h"
 #include "core/history/state_file.h"
+#include "core/layouts/table_layouts.h"
+#include "core/messages/agent_message.h"
 #include "core/runtime/clog.h"
 #include "framework/clock.h"
-#include "q7tema/table_layouts.h"
-#include "tama/agent_message.h"
-#include "tama/cconfig.h"
 
 namespace {
 
@@ -31,11 +32,6 @@ long IntervalSeconds() {
 }
 long IntervalStart(long t) {
   return t - (t % IntervalSeconds());
-}
-
-CDPXAnalyzer::FeederFactory& Factory() {
-  static CDPXAnalyzer::FeederFactory factory;
-  return factory;
 }
 
 CDPXAnalyzer::Paths DefaultPaths() {
@@ -69,10 +65,6 @@ CDPXAnalyzer* CDPXAnalyzer::GetInstance() {
 
 CDPXAnalyzer* CDPXAnalyzer::GetInstanceIfStarted() {
   return g_started.load();
-}
-
-void CDPXAnalyzer::setFeederFactory(FeederFactory factory) {
-  Factory() = std::move(factory);
 }
 
 CDPXAnalyzer::CDPXAnalyzer(Paths p)
@@ -156,11 +148,12 @@ void CDPXAnalyzer::finishRun() {
 
 void CDPXAnalyzer::Run() {
   static const char* const kWhere = "CDPXAnalyzer::Run";
-  if (Factory()) {
-    feeder = Factory()(paths.dataDirectory.c_str());
-    if (feeder) {
-      feeder->start();
-    }
+  if (!paths.dataDirectory.empty()) {
+    auto manager = std::make_unique<CDPXFileManager>();
+    manager->setDirToWatch(paths.dataDirectory.c_str());
+    manager->setSink(this);
+    feeder = std::move(manager);
+    feeder->start();
   }
   startRun();
   bool shutdownSeen = false;

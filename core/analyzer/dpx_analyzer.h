@@ -27,25 +27,14 @@ class InstanceFile;
 class StateFile;
 }  // namespace history
 
-// What feeds the queue: the file manager thread. The analyzer creates it when its thread
-// starts and stops it first at shutdown.
-class CAnalyzerFeeder {
- public:
-  virtual ~CAnalyzerFeeder() = default;
-  virtual void start() = 0;
-  // Asks the feeder to stop and waits for its thread.
-  virtual void shutdownAndJoin() = 0;
-};
-
 class CDPXAnalyzer : public CAnalyzer, public CvelThread {
  public:
   // Directories the analyzer works in. The defaults come from CConfig.
   struct Paths {
     std::string historyDirectory;  // over-time history, instance and pattern files
     std::string stateFile;         // the last-history-sent state
-    std::string dataDirectory;     // where the collector writes (handed to the feeder)
+    std::string dataDirectory;     // where the collector writes; empty: no file manager
   };
-  using FeederFactory = std::function<std::unique_ptr<CAnalyzerFeeder>(const char* dataDir)>;
 
   // The singleton, created on first use; GetInstance also starts its thread.
   static CDPXAnalyzer* GetInstance();
@@ -53,9 +42,6 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // The singleton once GetInstance has started it, else null; never creates it, so status
   // requests during start-up cannot build it before its settings are read.
   static CDPXAnalyzer* GetInstanceIfStarted();
-  // Sets what creates the feeder when the thread starts (none: nothing feeds the queue but
-  // add() calls). Call before the thread starts.
-  static void setFeederFactory(FeederFactory factory);
 
   // A free-standing analyzer (tests and benchmarks); the process uses the singleton.
   explicit CDPXAnalyzer(Paths paths);
@@ -154,7 +140,8 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   const Paths paths;
   std::unique_ptr<history::HistoryStore> history;
   std::unique_ptr<history::StateFile> state;
-  std::unique_ptr<CAnalyzerFeeder> feeder;  // analyzer thread only
+  // The file manager tailing dataDirectory, created when the thread starts. Analyzer thread.
+  std::unique_ptr<TransactionFeeder> feeder;
 
   CvelMutex treeMutex;
   // treeMutex guards the following.

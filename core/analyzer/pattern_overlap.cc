@@ -24,7 +24,7 @@
 #include <utility>
 #include <vector>
 
-#include "core/analyzer/common.h"
+#include "core/analyzer/intake/common.h"
 
 namespace {
 

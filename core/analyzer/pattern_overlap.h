@@ -14,7 +14,7 @@
 
 #include <string>
 
-#include "core/analyzer/parse_info.h"
+#include "core/analyzer/intake/parse_info.h"
 
 // True when some text matches both pattern a and pattern b. A null pattern matches nothing.
 // When witness is non-null and the answer is true, *witness receives one such text (UTF-8,

@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "core/analyzer/common.h"
+#include "core/analyzer/intake/common.h"
 
 namespace {
 

@@ -13,10 +13,10 @@
 #include <utility>
 
 #include "core/analyzer/pattern_overlap.h"
-#include "core/history/file_io.h"
 #include "core/runtime/clog.h"
 #include "core/runtime/misc.h"
 #include "framework/atomic_file.h"
+#include "framework/file_io.h"
 #include "framework/status.h"
 
 // Pattern files: a format version word (uint32, host byte order) followed by fixed-size records
@@ -137,21 +137,6 @@ std::string StartImage() {
   return image;
 }
 
-bool ReadAll(int fd, char* data, size_t size) {
-  size_t done = 0;
-  while (done < size) {
-    const ssize_t n = ::pread(fd, data + done, size - done, static_cast<off_t>(done));
-    if (n < 0 && errno == EINTR) {
-      continue;
-    }
-    if (n <= 0) {
-      return false;  // a read error, or the file shrank under us
-    }
-    done += static_cast<size_t>(n);
-  }
-  return true;
-}
-
 bool Later(const timespec& a, const timespec& b) {
   return a.tv_sec != b.tv_sec ? a.tv_sec > b.tv_sec : a.tv_nsec > b.tv_nsec;
 }
@@ -184,7 +169,7 @@ long RecordCount(const std::string& image, size_t recordSize, const char* path) 
 template <typename File>
 bool ReadIfNewer(File& file, std::string* image) {
   static constexpr const char* kWhere = "CSituationController::loadPatternsIfNewer";
-  history::UniqueFd fd(::open(file.path.c_str(), O_RDONLY | O_CLOEXEC));
+  fw::UniqueFd fd(::open(file.path.c_str(), O_RDONLY | O_CLOEXEC));
   if (!fd.valid()) {
     if (errno != ENOENT) {
       CLOG::error("%s: cannot open %s: %s", kWhere, file.path.c_str(), strerror(errno));
@@ -203,7 +188,8 @@ bool ReadIfNewer(File& file, std::string* image) {
   // every rollover.
   file.loaded = st.st_mtim;
   image->resize(static_cast<size_t>(st.st_size));
-  if (!ReadAll(fd.get(), image->data(), image->size())) {
+  if (fw::ReadAt(fd.get(), image->data(), image->size(), 0) !=
+      static_cast<ssize_t>(image->size())) {
     CLOG::error("%s: cannot read %s: %s", kWhere, file.path.c_str(), strerror(errno));
     return false;
   }

@@ -26,7 +26,7 @@
 #include <utility>
 #include <vector>
 
-#include "core/analyzer/common.h"
+#include "core/analyzer/intake/common.h"
 #include "core/runtime/cvel_mutex.h"
 
 // Text field widths in bytes, the terminating NUL included. Texts are UTF-8.

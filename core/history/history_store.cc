@@ -11,10 +11,10 @@
 #include <system_error>
 #include <utility>
 
-#include "core/history/file_io.h"
 #include "core/history/history_file_name.h"
 #include "core/runtime/clog.h"
 #include "framework/atomic_file.h"
+#include "framework/file_io.h"
 #include "framework/status.h"
 
 namespace history {
@@ -23,7 +23,7 @@ namespace {
 
 // An open history file and the number of whole records it holds.
 struct RecordFile {
-  UniqueFd fd;
+  fw::UniqueFd fd;
   size_t records = 0;
 };
 
@@ -38,7 +38,7 @@ RecordFile OpenRecords(const std::string& path, size_t record_size, const char* 
     }
     return file;
   }
-  const off_t size = FileSize(file.fd.get());
+  const off_t size = fw::FileSize(file.fd.get());
   if (size < 0) {
     CLOG::error("%s cannot examine %s: %s", where, path.c_str(), std::strerror(errno));
     file.fd.reset();
@@ -61,7 +61,7 @@ size_t ReadRecords(const RecordFile& file, size_t record_size, size_t max_record
   if (wanted == 0) {
     return 0;
   }
-  const ssize_t got = ReadAt(file.fd.get(), out, wanted * record_size, 0);
+  const ssize_t got = fw::ReadAt(file.fd.get(), out, wanted * record_size, 0);
   if (got < 0) {
     CLOG::error("%s cannot read %s: %s", where, path.c_str(), std::strerror(errno));
     return 0;

@@ -54,7 +54,7 @@ bool InstanceFile::flush() {
     return true;
   }
   const size_t records = pending_.size() / record_size_;
-  const bool written = fd_.valid() && WriteAll(fd_.get(), pending_.data(), pending_.size());
+  const bool written = fd_.valid() && fw::WriteAll(fd_.get(), pending_.data(), pending_.size());
   if (written) {
     committed_ += static_cast<off_t>(pending_.size());
     pending_.clear();
@@ -86,8 +86,8 @@ bool InstanceFile::switchTo(int64_t interval) {
     return false;
   }
   const std::string path = directory_ + "/" + IntervalFileName(interval, stem_);
-  UniqueFd fd = OpenCreatingParent(path, O_WRONLY | O_CREAT | O_APPEND);
-  const off_t size = fd.valid() ? FileSize(fd.get()) : -1;
+  fw::UniqueFd fd = fw::OpenCreatingParent(path, O_WRONLY | O_CREAT | O_APPEND);
+  const off_t size = fd.valid() ? fw::FileSize(fd.get()) : -1;
   if (size < 0) {
     CLOG::error("%s cannot open %s: %s", kWhere, path.c_str(), std::strerror(errno));
     return false;

@@ -21,7 +21,7 @@
 #include <string>
 #include <vector>
 
-#include "core/history/file_io.h"
+#include "framework/file_io.h"
 
 namespace history {
 
@@ -58,7 +58,7 @@ class InstanceFile {
   const std::string stem_;
   const size_t record_size_;        // bytes per record
   int64_t interval_ = -1;           // interval start of the open file, -1 before the first
-  UniqueFd fd_;                     // the open file (O_APPEND); invalid when opening failed
+  fw::UniqueFd fd_;                 // the open file (O_APPEND); invalid when opening failed
   off_t committed_ = 0;             // bytes of the open file known to be whole records
   std::vector<std::byte> pending_;  // whole records not yet written
   uint64_t dropped_ = 0;            // records lost to failed opens or writes

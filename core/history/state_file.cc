@@ -7,9 +7,9 @@
 #include <cstring>
 #include <utility>
 
-#include "core/history/file_io.h"
 #include "core/runtime/clog.h"
 #include "framework/atomic_file.h"
+#include "framework/file_io.h"
 #include "framework/status.h"
 
 namespace history {
@@ -26,7 +26,7 @@ bool StateFile::load() {
   static const char* const kWhere = "StateFile::load";
   last_query_.clear();
   other_lines_.clear();
-  UniqueFd fd(::open(path_.c_str(), O_RDONLY | O_CLOEXEC));
+  fw::UniqueFd fd(::open(path_.c_str(), O_RDONLY | O_CLOEXEC));
   if (!fd.valid()) {
     if (errno == ENOENT) {
       return true;
@@ -34,9 +34,9 @@ bool StateFile::load() {
     CLOG::error("%s cannot open %s: %s", kWhere, path_.c_str(), std::strerror(errno));
     return false;
   }
-  const off_t size = FileSize(fd.get());
+  const off_t size = fw::FileSize(fd.get());
   std::string text(size > 0 ? static_cast<size_t>(size) : 0, '\0');
-  const ssize_t got = size < 0 ? -1 : ReadAt(fd.get(), text.data(), text.size(), 0);
+  const ssize_t got = size < 0 ? -1 : fw::ReadAt(fd.get(), text.data(), text.size(), 0);
   if (got < 0) {
     CLOG::error("%s cannot read %s: %s", kWhere, path_.c_str(), std::strerror(errno));
     return false;

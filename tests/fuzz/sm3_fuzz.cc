@@ -8,9 +8,9 @@
 #include <string>
 #include <vector>
 
-#include "core/analyzer/sm3_framing.h"
-#include "core/analyzer/sm3_parser.h"
-#include "core/analyzer/transaction_identity.h"
+#include "core/analyzer/intake/sm3_framing.h"
+#include "core/analyzer/intake/sm3_parser.h"
+#include "core/analyzer/intake/transaction_identity.h"
 #include "framework/trace.h"
 
 namespace {

@@ -14,11 +14,11 @@
 #include <vector>
 
 #include "core/analyzer/dpx_analyzer.h"
-#include "core/analyzer/dpx_transaction.h"
+#include "core/analyzer/intake/dpx_transaction.h"
 #include "core/analyzer/rows/rows.h"
 #include "core/analyzer/testing/transaction_builder.h"
+#include "core/config/cconfig.h"
 #include "framework/clock.h"
-#include "tama/cconfig.h"
 #include "tests/support/scratch_dir.h"
 
 namespace q7test {

@@ -4,8 +4,8 @@
 // aggregated. Built from the processed working copy, the patterns it matched and its original
 // recorded time.
 
-#include "core/analyzer/dpx_transaction.h"
-#include "q7tema/table_layouts.h"
+#include "core/analyzer/intake/dpx_transaction.h"
+#include "core/layouts/table_layouts.h"
 
 // The pattern texts an instance row names (empty for a made-up match).
 struct InstancePatterns {

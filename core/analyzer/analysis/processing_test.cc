@@ -14,14 +14,14 @@
 
 #include "core/analyzer/analysis/analyzer_fixture.h"
 #include "core/analyzer/dpx_analyzer.h"
-#include "core/analyzer/dpx_transaction.h"
+#include "core/analyzer/intake/dpx_transaction.h"
 #include "core/analyzer/rows/rows.h"
 #include "core/analyzer/situation_controller.h"
+#include "core/config/cconfig.h"
 #include "core/history/history_store.h"
+#include "core/messages/agent_message.h"
 #include "framework/clock.h"
 #include "framework/trace_capture.h"
-#include "tama/agent_message.h"
-#include "tama/cconfig.h"
 #include "tests/support/scratch_dir.h"
 
 namespace {

@@ -8,10 +8,10 @@
 
 #include "core/analyzer/dpx_analyzer.h"
 #include "core/analyzer/rows/rows.h"
+#include "core/config/cconfig.h"
 #include "core/history/history_store.h"
 #include "core/runtime/clog.h"
 #include "framework/clock.h"
-#include "tama/cconfig.h"
 
 namespace {
 

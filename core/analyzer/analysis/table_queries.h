@@ -3,7 +3,7 @@
 // The tables the analyzer answers, listed once for the query declarations and definitions, and
 // the current-status conversions.
 
-#include "q7tema/table_layouts.h"
+#include "core/layouts/table_layouts.h"
 
 // Over-time tables: name (kq7_q7<name>_data_t, history stem q7<name>).
 #define Q7_OVER_TIME_QUERIES(X) \

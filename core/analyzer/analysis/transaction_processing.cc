@@ -7,15 +7,15 @@
 #include <optional>
 
 #include "core/analyzer/analysis/instance_rows.h"
-#include "core/analyzer/common.h"
 #include "core/analyzer/dpx_analyzer.h"
-#include "core/analyzer/dpx_transaction.h"
+#include "core/analyzer/intake/common.h"
+#include "core/analyzer/intake/dpx_transaction.h"
 #include "core/analyzer/rows/rows.h"
 #include "core/analyzer/situation_controller.h"
+#include "core/config/cconfig.h"
 #include "core/history/instance_file.h"
 #include "core/runtime/clog.h"
 #include "framework/clock.h"
-#include "tama/cconfig.h"
 
 namespace {
 

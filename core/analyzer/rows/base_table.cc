@@ -5,11 +5,11 @@
 #include <ctime>
 #include <string>
 
-#include "core/analyzer/dpx_transaction.h"
-#include "core/analyzer/other_transactions.h"
+#include "core/analyzer/intake/dpx_transaction.h"
+#include "core/analyzer/intake/other_transactions.h"
+#include "core/config/cconfig.h"
 #include "core/runtime/clog.h"
 #include "framework/clock.h"
-#include "tama/cconfig.h"
 
 namespace {
 

@@ -15,10 +15,10 @@
 #include <cstring>
 #include <string>
 
-#include "core/analyzer/dpx_transaction.h"
+#include "core/analyzer/intake/dpx_transaction.h"
 #include "core/analyzer/rows/base_table.h"
+#include "core/layouts/table_layouts.h"
 #include "framework/agent_runtime.h"
-#include "q7tema/table_layouts.h"
 
 namespace rows {
 

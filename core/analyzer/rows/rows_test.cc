@@ -8,11 +8,11 @@
 #include <string>
 #include <vector>
 
-#include "core/analyzer/other_transactions.h"
+#include "core/analyzer/intake/other_transactions.h"
 #include "core/analyzer/testing/transaction_builder.h"
+#include "core/config/cconfig.h"
 #include "framework/clock.h"
 #include "framework/trace_capture.h"
-#include "tama/cconfig.h"
 
 namespace {
 

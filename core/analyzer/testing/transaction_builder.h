@@ -14,8 +14,8 @@
 #include <cstdio>
 #include <string>
 
-#include "core/analyzer/dpx_transaction.h"
-#include "core/analyzer/sm3_entry.h"
+#include "core/analyzer/intake/dpx_transaction.h"
+#include "core/analyzer/intake/sm3_entry.h"
 
 class TransactionBuilder {
  public:

@@ -1,0 +1,222 @@
+#include "core/analyzer/intake/dpx_data_file_monitor.h"
+
+#include <cstring>
+#include <memory>
+#include <string>
+
+#include "core/analyzer/intake/common.h"
+#include "core/analyzer/intake/dpx_transaction.h"
+#include "core/analyzer/intake/sm3_framing.h"
+#include "core/analyzer/intake/sm3_parser.h"
+#include "core/analyzer/intake/transaction_identity.h"
+#include "core/config/cconfig.h"
+#include "core/runtime/clog.h"
+#include "core/runtime/misc.h"
+
+namespace {
+
+constexpr unsigned long kSummaryFlag = 2;
+constexpr unsigned long kFlowFlag = 64;
+constexpr int kStaticWaitSeconds = 30;
+constexpr unsigned long kPauseMillis = 100;
+
+}  // namespace
+
+// The per-run state of record processing: the identity of the page the next objects belong
+// to, and where records go. Lives on the monitor thread's stack for one run of Run.
+class CDPXDataFileMonitor::RecordHandler : public CSM3RecordSink {
+ public:
+  RecordHandler(TransactionSink& sink, int excludeOutlierMillis)
+      : sink(sink), excludeOutlierMillis(excludeOutlierMillis) {}
+
+  bool processSM3Line(char* line, int recordType) override {
+    // Stop the pass here: this record and the rest of the chunk are not consumed, so the
+    // persisted offset makes the next start read them.
+    if (sink.isShutdownRequested()) {
+      refused = true;
+      return false;
+    }
+    IntakeCounters& counters = sink.intakeCounters();
+    counters.recordRead();
+    std::unique_ptr<CDPXTransaction> transaction = createDPXTransaction(line, recordType);
+    if (!transaction) {
+      counters.recordUnparsed();
+      return true;
+    }
+    if (!isValidTrans(*transaction, excludeOutlierMillis)) {
+      counters.outlierDropped();
+      CLOG::min("%s Ignoring transaction, determined to be \"invalid\"", "processSM3Line");
+      return true;
+    }
+    // The parsed record is already a transaction of its own; queue it without a copy.
+    transaction->setRecordType(recordType);
+    doUUIDs(*transaction, &previousPage, &instanceCounter, &pageSeen);
+    sink.add(_TYPED_TRANSACTION{TRANSACTION_KIND_DPX, transaction.release()});
+    return true;
+  }
+  bool wasRefused() const { return refused; }
+
+ private:
+  TransactionSink& sink;
+  bool refused = false;  // a record was refused: the sink is shutting down
+  const int excludeOutlierMillis;
+  CUUID previousPage;  // all zero until the first page
+  int64_t instanceCounter = initialInstanceCounter();
+  bool pageSeen = true;
+};
+
+CDPXDataFileMonitor::CDPXDataFileMonitor(const char* file, long long offset)
+    : CDataFileMonitor("DPXDataFileMonitor", file) {
+  static const char* const kWhere = "CDPXDataFileMonitor::CDPXDataFileMonitor";
+  CLOG::trace(kFlowFlag, "%s ENTER [%s][%ld]\n", kWhere, file != nullptr ? file : "",
+              static_cast<long>(offset));
+  isStatic.store(false);
+  completed.store(false);
+  setLastProcessedOffset(offset);
+  CLOG::trace(kFlowFlag, "%s EXIT \n", kWhere);
+}
+
+CDPXDataFileMonitor::~CDPXDataFileMonitor() = default;
+
+void CDPXDataFileMonitor::waitForCompletion(int seconds) const {
+  const long steps = static_cast<long>(seconds) * 1000 / static_cast<long>(kPauseMillis);
+  for (long i = 0; i < steps && !completed.load(); ++i) {
+    CMisc::sleep(kPauseMillis);
+  }
+}
+
+bool CDPXDataFileMonitor::isValidTrans(const CDPXTransaction& transaction,
+                                       int excludeOutlierMillis) {
+  if (excludeOutlierMillis < 0 || transaction.getTotalResponseTime() < excludeOutlierMillis) {
+    return true;
+  }
+  CLOG::min("%s Trans is NOT valid.  totalResponseTime[%d] excludeOutlierMillis[%d]",
+            "CDPXDataFileMonitor::isValidTrans", transaction.getTotalResponseTime(),
+            excludeOutlierMillis);
+  return false;
+}
+
+bool CDPXDataFileMonitor::getNewLegacyFilename(const char* file, char* newName, int size) {
+  std::string prefix = file;
+  const size_t dot = prefix.find('.');
+  if (dot != std::string::npos) {
+    prefix.resize(dot);
+  }
+  CLOG::min("Prefix [%s]", prefix.c_str());
+  _FILE_INFO_LL* const list = CCommon::findFiles(CConfig::getDpxDataDirectory(), "*.sm3");
+  const char* best = nullptr;
+  for (const _FILE_INFO_LL* node = list; node != nullptr; node = node->next) {
+    const char* name = node->fileName;
+    if (std::strncmp(name, prefix.c_str(), prefix.size()) == 0 &&
+        std::strchr(name, '-') != nullptr && (best == nullptr || std::strcmp(name, best) > 0)) {
+      best = name;
+    }
+  }
+  const bool found = best != nullptr && size > 0;
+  if (found) {
+    const size_t n = std::min(std::strlen(best), static_cast<size_t>(size - 1));
+    std::memcpy(newName, best, n);
+    newName[n] = '\0';
+  }
+  CCommon::deleteFoundFiles(list);
+  return found;
+}
+
+std::unique_ptr<CDPXDataFileMonitor> CDPXDataFileMonitor::processStatically(
+    const char* file, long long offset, int excludeOutlierMillis, TransactionSink* sink) {
+  auto monitor = std::make_unique<CDPXDataFileMonitor>(file, offset);
+  monitor->setStatic();
+  monitor->setExcludeOutlierMillis(excludeOutlierMillis);
+  monitor->setSink(sink);
+  monitor->Start();
+  monitor->waitForCompletion(kStaticWaitSeconds);
+  monitor->Shutdown();
+  monitor->Join();
+  return monitor;
+}
+
+bool CDPXDataFileMonitor::handleLegacyDPXRename() {
+  if (isStatic.load()) {
+    return false;
+  }
+  bool renamed = false;
+  long long size = 0;
+  if (!CMisc::getFileSize64(getFile(), &size)) {
+    CLOG::min("File [%s] is no longer present, must of been renamed or deleted.", getFile());
+    renamed = true;
+  } else if (size < getReadToOffset()) {
+    CLOG::min("File [%s] is smaller [%lld] than expected [%lld], must of been renamed", getFile(),
+              size, getReadToOffset());
+    renamed = true;
+  }
+  if (renamed) {
+    char newName[kFileInfoMaxPath + 1];
+    if (getNewLegacyFilename(getFile(), newName, sizeof(newName))) {
+      CLOG::min(
+          "Found new file name [%s] for previous file [%s]. Will process any remaining "
+          "records.",
+          newName, getFile());
+      processStatically(newName, getLastProcessedOffset(), getExcludeOutlierMillis(), sink);
+    }
+    setLastProcessedOffset(0);
+  }
+  return renamed;
+}
+
+void CDPXDataFileMonitor::Run() {
+  static const char* const kWhere = "CDPXDataFileMonitor::Run()";
+  completed.store(false);
+  if (sink == nullptr) {
+    CLOG::min("%s No sink for [%s]; nothing read.", kWhere, getFile());
+    completed.store(true);
+    return;
+  }
+  RecordHandler handler(*sink, getExcludeOutlierMillis());
+  sink->intakeCounters().reading(getFile(), getLastProcessedOffset());
+  while (!isShutdownRequested()) {
+    bool updates = anyUpdates();
+    if (!updates) {
+      const bool renamed = handleLegacyDPXRename();
+      if (renamed) {
+        updates = anyUpdates();
+      }
+      if (!renamed || !updates) {
+        CMisc::sleep(kPauseMillis);
+      }
+    }
+    if (updates) {
+      long length = 0;
+      long long end = 0;
+      std::unique_ptr<char[]> chunk = getNewFileContents(&length, &end);
+      if (chunk) {
+        CLOG::trace(kSummaryFlag, "%s Read in some new file contents!", kWhere);
+        CLOG::trace(kSummaryFlag, "%s Old offset[%lld] read to offset[%lld]", kWhere,
+                    getLastProcessedOffset(), end);
+        const long consumed =
+            processDPXContents(chunk.get(), length, length == MAX_BUFFER, handler);
+        if (consumed != length) {
+          CLOG::med("only processed %u of %u bytes!", static_cast<unsigned>(consumed),
+                    static_cast<unsigned>(length));
+        }
+        advanceLastProcessedOffset(consumed);
+        sink->intakeCounters().reading(getFile(), getLastProcessedOffset());
+      } else {
+        CLOG::trace(kFlowFlag, "Failed to read in any new file contents");
+      }
+    }
+    if (isStatic.load() && !updates) {
+      Shutdown();
+    }
+    if (handler.wasRefused()) {
+      interrupted.store(true);
+      // Nothing more can be handed over; a static monitor would only spin on the same chunk
+      // until its owner gave up waiting.
+      if (isStatic.load()) {
+        Shutdown();
+      } else {
+        CMisc::sleep(kPauseMillis);  // the owner's stop follows shortly
+      }
+    }
+  }
+  completed.store(true);
+}
