@@ -198,8 +198,8 @@ int main(int argc, char** argv) {
   }
   const auto fileBytes = static_cast<long long>(std::filesystem::file_size(file));
 
-  CDPXAnalyzer analyzer({CConfig::getDpxOdiDataDirectory(), dir + "/q7state.properties",
-                         CConfig::getDpxDataDirectory()});
+  // No data directory: the one monitor below is the only reader, as the bench measures it.
+  CDPXAnalyzer analyzer({CConfig::getDpxOdiDataDirectory(), dir + "/q7state.properties", ""});
   AddPatterns(analyzer);
   analyzer.Start();
 

@@ -53,7 +53,7 @@ int main() {
   char dirName[] = "/tmp/q7bench-sample-XXXXXX";
   const std::string dir = mkdtemp(dirName);
 
-  CDPXAnalyzer analyzer({dir + "/dpx", dir + "/state", dir + "/data"});
+  CDPXAnalyzer analyzer({dir + "/dpx", dir + "/state", ""});
   analyzer.newTransactionPattern("all", "All", "*", "All", "*", 1, 1, 0, 100, 300, 99);
   analyzer.startRun();
   short level = 0;

@@ -27,13 +27,6 @@ constexpr long kShutdownWaitMillis = 50;
 // Every this many rollovers the old history files are removed.
 constexpr int kCleanupEveryRollovers = 12;
 
-long IntervalSeconds() {
-  return static_cast<long>(CConfig::getOverTimeInterval()) * 60;
-}
-long IntervalStart(long t) {
-  return t - (t % IntervalSeconds());
-}
-
 CDPXAnalyzer::Paths DefaultPaths() {
   CDPXAnalyzer::Paths paths;
   paths.historyDirectory = CConfig::getDpxOdiDataDirectory();
@@ -73,7 +66,7 @@ CDPXAnalyzer::CDPXAnalyzer(Paths p)
       paths(std::move(p)),
       history(std::make_unique<history::HistoryStore>(paths.historyDirectory)),
       state(std::make_unique<history::StateFile>(paths.stateFile)),
-      trees(std::make_unique<COverTimeTrees>()),
+      cache(std::make_unique<IntervalCache>(*history)),
       instanceFile(std::make_unique<history::InstanceFile>(paths.historyDirectory, "q7txins",
                                                            sizeof(kq7_q7txins_data_t))),
       subInstanceFile(std::make_unique<history::InstanceFile>(paths.historyDirectory, "q7subtxins",
@@ -90,7 +83,8 @@ CDPXAnalyzer::~CDPXAnalyzer() {
 }
 
 bool CDPXAnalyzer::rolloverDue() const {
-  return cacheActive ? isNewOverTimeInterval(referenceInterval) : isNewOverTimeInterval();
+  CvelMutexLock lock(treeMutex);
+  return cache->active() ? isNewOverTimeInterval(referenceInterval) : isNewOverTimeInterval();
 }
 
 void CDPXAnalyzer::startRun() {
@@ -100,17 +94,16 @@ void CDPXAnalyzer::startRun() {
   CvelMutexLock lock(treeMutex);
   // The current interval's rows saved by an earlier run stay the current trees, so a restart
   // within an interval keeps its data.
-  trees->load(*history, getCurrentOverTimeInterval());
-  cacheActive = false;
+  cache->loadCurrent(getCurrentOverTimeInterval());
   referenceInterval = getCurrentOverTimeInterval();
   rolloverCount = 0;
 }
 
 void CDPXAnalyzer::rollover() {
   CvelMutexLock lock(treeMutex);
-  flushCache();
-  if (cacheActive) {
-    deactivateCache();
+  cache->flush();
+  if (cache->active()) {
+    cache->deactivate(getCurrentOverTimeInterval());
   }
   if (oldTransactions > 0) {
     AgentMessage::sendMessage(
@@ -124,9 +117,9 @@ void CDPXAnalyzer::rollover() {
   updateCurrentOverTimeInterval();
   auto fresh = std::make_unique<COverTimeTrees>();
   if (CConfig::getReportZeroRecords()) {
-    fresh->seedZeroRows(*trees, getCurrentOverTimeInterval());
+    fresh->seedZeroRows(cache->trees(), getCurrentOverTimeInterval());
   }
-  trees = std::move(fresh);
+  cache->replaceCurrent(std::move(fresh));
   referenceInterval = getCurrentOverTimeInterval();
   if (++rolloverCount % kCleanupEveryRollovers == 0) {
     cleanupOldFiles();
@@ -137,8 +130,8 @@ void CDPXAnalyzer::rollover() {
 void CDPXAnalyzer::finishRun() {
   {
     CvelMutexLock lock(treeMutex);
-    flushCache();
-    destroyCache();
+    cache->flush();
+    cache->discard();
     saveAllData(getCurrentOverTimeInterval());
     flushInstanceFile();
     flushSubInstanceFile();
@@ -227,6 +220,12 @@ void CDPXAnalyzer::printPerformanceStats() const {
   }
 }
 
+void CDPXAnalyzer::flushInstanceFiles() {
+  CvelMutexLock lock(treeMutex);
+  flushInstanceFile();
+  flushSubInstanceFile();
+}
+
 void CDPXAnalyzer::flushInstanceFile() {
   instanceFile->flush();
 }
@@ -234,53 +233,8 @@ void CDPXAnalyzer::flushSubInstanceFile() {
   subInstanceFile->flush();
 }
 
-// ---- Caches ----
-
-void CDPXAnalyzer::loadCache(long interval) {
-  CLOG::med("Loading cache for interval[%d]", static_cast<int>(interval));
-  trees->load(*history, interval);
-}
-
-void CDPXAnalyzer::activateCache(long time) {
-  const long interval = IntervalStart(time);
-  CLOG::med("Activating cache for interval[%d] where currentTimePeriod[%d]",
-            static_cast<int>(interval), getCurrentOverTimeInterval());
-  savedTrees = std::move(trees);
-  trees = std::make_unique<COverTimeTrees>();
-  loadCache(interval);
-  cacheInterval = interval;
-  cacheActive = true;
-}
-
-void CDPXAnalyzer::deactivateCache() {
-  if (!cacheActive) {
-    CLOG::min("Error: Attempting to deactivate cache when one is not active");
-    return;
-  }
-  CLOG::med("Deactivating cache for interval[%d] where currentTimePeriod[%d]",
-            static_cast<int>(cacheInterval), getCurrentOverTimeInterval());
-  CLOG::med("Saving cache for interval[%d]", static_cast<int>(cacheInterval));
-  trees->save(*history, cacheInterval);
-  trees = std::move(savedTrees);
-  cacheActive = false;
-}
-
-void CDPXAnalyzer::flushCache() {
-  if (cacheActive) {
-    CLOG::med("Saving cache for interval[%d]", static_cast<int>(cacheInterval));
-    trees->save(*history, cacheInterval);
-  }
-}
-
-void CDPXAnalyzer::destroyCache() {
-  if (cacheActive) {
-    trees = std::move(savedTrees);
-    cacheActive = false;
-  }
-}
-
 void CDPXAnalyzer::saveIntervalData(long interval) {
-  trees->save(*history, interval);
+  cache->trees().save(*history, interval);
   flushInstanceFile();
   flushSubInstanceFile();
 }

@@ -7,20 +7,24 @@
 // drains the queue and saves everything.
 //
 // Threads: GetInstance/GetInstanceNoStart from any thread (the first call creates the object);
-// add() from intake threads; Lock()/Unlock() and the queries from framework threads; the rest
-// from the analyzer thread. The tree lock (Lock/Unlock) guards the trees, the cache state and
-// the instance files.
+// add() from intake threads; the queries, visitTrees and flushInstanceFiles from framework
+// threads; the rest from the analyzer thread. The tree lock (private, taken by those entry
+// points) guards the trees, the cache state and the instance files.
 
+#include <atomic>
 #include <functional>
 #include <memory>
 
+#include "core/analyzer/analysis/interval_cache.h"
 #include "core/analyzer/analysis/over_time_trees.h"
 #include "core/analyzer/analysis/table_queries.h"
 #include "core/analyzer/analyzer.h"
 #include "core/runtime/cvel_mutex.h"
 #include "core/runtime/cvel_thread.h"
+#include "framework/thread_annotations.h"
 
 class CDPXTransaction;
+struct InstancePatterns;
 namespace history {
 class HistoryStore;
 class InstanceFile;
@@ -47,9 +51,6 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   explicit CDPXAnalyzer(Paths paths);
   ~CDPXAnalyzer() override;
 
-  void Lock() { treeMutex.Lock(); }
-  void Unlock() { treeMutex.Unlock(); }
-
   // Processes one transaction (see transaction_processing.cc). instanceLevel carries the
   // instance level of the last page to the objects that follow it.
   void processTransaction(CDPXTransaction& transaction, short* instanceLevel);
@@ -64,12 +65,13 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // releases with delete[], and their count through count (null with 0). Only sample type 3
   // yields rows. The public ones take the tree lock, flush the cache and stamp sampletime; the
   // inner ones (i_get_tbl...) run with the lock held. ----
-#define Q7_DECLARE_OVER_TIME_QUERY(name)                            \
-  kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count); \
-  kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count, bool currentOnly);
+#define Q7_DECLARE_OVER_TIME_QUERY(name)                                               \
+  kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count);                    \
+  kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count, bool currentOnly) \
+      REQUIRES(treeMutex);
 #define Q7_DECLARE_QUERY(name)                                      \
   kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count); \
-  kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count);
+  kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count) REQUIRES(treeMutex);
   Q7_OVER_TIME_QUERIES(Q7_DECLARE_OVER_TIME_QUERY)
   Q7_SUMMARY_QUERIES(Q7_DECLARE_QUERY)
   Q7_INSTANCE_QUERIES(Q7_DECLARE_QUERY)
@@ -89,17 +91,15 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // Intervals in the summary period: summary hours x 60 / over-time minutes.
   static int summaryIntervals();
 
-  // The current interval's trees, or the cache's when one is active. Tree lock held.
-  COverTimeTrees& currentTrees() {
-    return *trees;
+  // Calls visit(trees) with the tree lock held: the trees processing updates (a past
+  // interval's while one is swapped in). For tests and diagnostics; any thread.
+  template <class Visit>
+  void visitTrees(Visit visit) EXCLUDES(treeMutex) {
+    CvelMutexLock lock(treeMutex);
+    visit(cache->trees());
   }
-  // The current interval's trees whether or not a cache is swapped in. Tree lock held.
-  COverTimeTrees& currentIntervalTrees() {
-    return cacheActive ? *savedTrees : *trees;
-  }
-  // Writes the instance files' buffered records. Tree lock held.
-  void flushInstanceFile();
-  void flushSubInstanceFile();
+  // Writes the instance files' buffered records; any thread.
+  void flushInstanceFiles() EXCLUDES(treeMutex);
   history::HistoryStore& historyStore() {
     return *history;
   }
@@ -116,25 +116,29 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   void Run() override;
 
  private:
-  // Caches: a past interval's rows swapped in for transactions that belong to it. Tree lock.
-  void activateCache(long time);
-  void deactivateCache();
-  void loadCache(long interval);
-  void flushCache();
+  // Write the instance files' buffered records.
+  void flushInstanceFile() REQUIRES(treeMutex);
+  void flushSubInstanceFile() REQUIRES(treeMutex);
+  // Steps of processTransaction (transaction_processing.cc).
+  void restampIfTooOld(CDPXTransaction& transaction);
+  void selectTreesFor(long t) REQUIRES(treeMutex);
+  void recordInstance(CDPXTransaction& w, bool page, const InstancePatterns& names)
+      REQUIRES(treeMutex);
   template <class OverTimeRow>
   typename OverTimeRow::LayoutType* overTimeQuery(OverTimeTable table, const char* where,
-                                                  int sampleType, int* count, bool currentOnly);
+                                                  int sampleType, int* count, bool currentOnly)
+      REQUIRES(treeMutex);
   template <class SummaryRow>
   typename SummaryRow::LayoutType* summaryQuery(
       typename SummaryRow::OverTimeLayoutType* (CDPXAnalyzer::*inner)(int, int*, bool),
-      const char* where, int sampleType, int* count);
+      const char* where, int sampleType, int* count) REQUIRES(treeMutex);
   template <class Layout>
-  Layout* instanceQuery(const char* stem, const char* where, int sampleType, int* count);
+  Layout* instanceQuery(const char* stem, const char* where, int sampleType, int* count)
+      REQUIRES(treeMutex);
   template <class Layout, class Inner>
-  Layout* lockedQuery(Inner inner, int* count);
-  void destroyCache();
-  void saveIntervalData(long interval);
-  void saveAllData(long interval);
+  Layout* lockedQuery(Inner inner, int* count) EXCLUDES(treeMutex);
+  void saveIntervalData(long interval) REQUIRES(treeMutex);
+  void saveAllData(long interval) REQUIRES(treeMutex);
   void cleanupOldFiles();
 
   const Paths paths;
@@ -143,15 +147,14 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // The file manager tailing dataDirectory, created when the thread starts. Analyzer thread.
   std::unique_ptr<TransactionFeeder> feeder;
 
-  CvelMutex treeMutex;
-  // treeMutex guards the following.
-  std::unique_ptr<COverTimeTrees> trees;       // the trees processing updates
-  std::unique_ptr<COverTimeTrees> savedTrees;  // the current interval's while a cache is active
-  bool cacheActive = false;
-  long cacheInterval = 0;
-  long referenceInterval = 0;
-  std::unique_ptr<history::InstanceFile> instanceFile;
-  std::unique_ptr<history::InstanceFile> subInstanceFile;
+  // The tree lock: processing and rollover on the analyzer thread, queries on framework threads.
+  mutable CvelMutex treeMutex;
+  std::unique_ptr<IntervalCache> cache PT_GUARDED_BY(treeMutex);  // the trees, and the cache
+  std::unique_ptr<history::InstanceFile> instanceFile PT_GUARDED_BY(treeMutex);
+  std::unique_ptr<history::InstanceFile> subInstanceFile PT_GUARDED_BY(treeMutex);
+  // The interval transactions are judged against. Written by the analyzer thread under the
+  // tree lock, read by it without: an atomic, since nothing else reads it.
+  std::atomic<long> referenceInterval{0};
 
   int rolloverCount = 0;        // analyzer thread
   short lastInstanceLevel = 0;  // analyzer thread: the level of the last page

@@ -42,10 +42,11 @@ class AnalyzerFixture : public ::testing::Test {
   }
 
   // An analyzer on the test's directories; begun as its thread would begin unless it is to
-  // run as a thread.
+  // run as a thread. No data directory: the tests hand transactions over themselves, and no
+  // file manager runs.
   std::unique_ptr<CDPXAnalyzer> NewAnalyzer(bool begin = true) {
     auto analyzer = std::make_unique<CDPXAnalyzer>(
-        CDPXAnalyzer::Paths{dir_.file("dpx"), dir_.file("q7state.properties"), dir_.file("data")});
+        CDPXAnalyzer::Paths{dir_.file("dpx"), dir_.file("q7state.properties"), ""});
     if (begin) {
       analyzer->startRun();
     }
@@ -86,13 +87,13 @@ class AnalyzerFixture : public ::testing::Test {
   // Each row of an over-time table as "<toString>" -> requests.
   std::map<std::string, int> Rows(OverTimeTable table = OverTimeTable::kApplication) {
     std::map<std::string, int> out;
-    analyzer_->Lock();
-    std::vector<TreeNode*> nodes;
-    getTreeNodes(analyzer_->currentTrees().tree(table), nodes);
-    for (TreeNode* node : nodes) {
-      out[node->toString(0)] = static_cast<CBaseTable*>(node)->getCommon().totreq;
-    }
-    analyzer_->Unlock();
+    analyzer_->visitTrees([&](COverTimeTrees& trees) {
+      std::vector<TreeNode*> nodes;
+      getTreeNodes(trees.tree(table), nodes);
+      for (TreeNode* node : nodes) {
+        out[node->toString(0)] = static_cast<CBaseTable*>(node)->getCommon().totreq;
+      }
+    });
     return out;
   }
   static std::string App(const std::string& name) { return "ApplicationName=" + name + "\n"; }

@@ -82,10 +82,7 @@ TEST_F(ProcessingTest, InstanceLevelTwo) {
   Process(Page("shop.example", "/bad", 100, 500));
   Process(Object("shop.example", "/bad.css", 404));
   Process(Object("shop.example", "/good.css", 200));
-  analyzer_->Lock();
-  analyzer_->flushInstanceFile();
-  analyzer_->flushSubInstanceFile();
-  analyzer_->Unlock();
+  analyzer_->flushInstanceFiles();
   auto& store = analyzer_->historyStore();
   const long interval = analyzer_->getCurrentOverTimeInterval();
   EXPECT_EQ(1u, store.countRows("q7txins", interval, 1, 300, sizeof(kq7_q7txins_data_t)));

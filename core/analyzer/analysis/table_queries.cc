@@ -77,7 +77,7 @@ typename OverTimeRow::LayoutType* CDPXAnalyzer::overTimeQuery(OverTimeTable tabl
       currentOnly ? 0
                   : Capped(history->countRows(stem, interval - length, summaryIntervals(), length,
                                               sizeof(Layout)));
-  TSAVLTree& tree = currentIntervalTrees().tree(table);
+  TSAVLTree& tree = cache->currentIntervalTrees().tree(table);
   const size_t current = static_cast<size_t>(tree.getSize());
   if (historyRows + current == 0) {
     CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
@@ -174,7 +174,7 @@ Layout* CDPXAnalyzer::lockedQuery(Inner inner, int* count) {
   Layout* rows;
   {
     CvelMutexLock lock(treeMutex);
-    flushCache();
+    cache->flush();
     rows = inner();
   }
   // Stamped once the lock is released: sampling must not hold up processing for it.
@@ -184,15 +184,15 @@ Layout* CDPXAnalyzer::lockedQuery(Inner inner, int* count) {
 
 // ---- The named queries. ----
 
-#define Q7_OVER_TIME(name, table, Row)                                                    \
-  kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count,        \
-                                                       bool currentOnly) {                \
-    return overTimeQuery<Row>(OverTimeTable::table, "i_get_tbl" #name, sampleType, count, \
-                              currentOnly);                                               \
-  }                                                                                       \
-  kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) {        \
-    return lockedQuery<kq7_q7##name##_data_t>(                                            \
-        [&] { return i_get_tbl##name(sampleType, count, false); }, count);                \
+#define Q7_OVER_TIME(name, table, Row)                                                           \
+  kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count,               \
+                                                       bool currentOnly) {                       \
+    return overTimeQuery<Row>(OverTimeTable::table, "i_get_tbl" #name, sampleType, count,        \
+                              currentOnly);                                                      \
+  }                                                                                              \
+  kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) {               \
+    return lockedQuery<kq7_q7##name##_data_t>(                                                   \
+        [&]() REQUIRES(treeMutex) { return i_get_tbl##name(sampleType, count, false); }, count); \
   }
 Q7_OVER_TIME(appot, kApplication, CApplicationOverTime)
 Q7_OVER_TIME(clntappot, kClientApp, CClientAppOverTime)
@@ -204,14 +204,14 @@ Q7_OVER_TIME(txot, kTransaction, CTransactionOverTime)
 Q7_OVER_TIME(subtxot, kSubTransaction, CSubTransactionOverTime)
 #undef Q7_OVER_TIME
 
-#define Q7_SUMMARY(name, overTime, Row)                                                           \
-  kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count) {              \
-    return summaryQuery<Row>(&CDPXAnalyzer::i_get_tbl##overTime, "i_get_tbl" #name, sampleType,   \
-                             count);                                                              \
-  }                                                                                               \
-  kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) {                \
-    return lockedQuery<kq7_q7##name##_data_t>([&] { return i_get_tbl##name(sampleType, count); }, \
-                                              count);                                             \
+#define Q7_SUMMARY(name, overTime, Row)                                                         \
+  kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count) {            \
+    return summaryQuery<Row>(&CDPXAnalyzer::i_get_tbl##overTime, "i_get_tbl" #name, sampleType, \
+                             count);                                                            \
+  }                                                                                             \
+  kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) {              \
+    return lockedQuery<kq7_q7##name##_data_t>(                                                  \
+        [&]() REQUIRES(treeMutex) { return i_get_tbl##name(sampleType, count); }, count);       \
   }
 Q7_SUMMARY(appsm, appot, CApplicationSummary)
 Q7_SUMMARY(clntapp, clntappot, CClientAppSummary)
@@ -228,8 +228,8 @@ Q7_SUMMARY(subtxsm, subtxot, CSubTransactionSummary)
     return instanceQuery<kq7_q7##name##_data_t>("q7" #name, "i_get_tbl" #name, sampleType, count); \
   }                                                                                                \
   kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) {                 \
-    return lockedQuery<kq7_q7##name##_data_t>([&] { return i_get_tbl##name(sampleType, count); },  \
-                                              count);                                              \
+    return lockedQuery<kq7_q7##name##_data_t>(                                                     \
+        [&]() REQUIRES(treeMutex) { return i_get_tbl##name(sampleType, count); }, count);          \
   }
 Q7_INSTANCE(txins)
 Q7_INSTANCE(subtxins)
@@ -243,7 +243,7 @@ Q7_INSTANCE(subtxins)
     std::unique_ptr<kq7_q7##ot##_data_t[]> overTime;                           \
     {                                                                          \
       CvelMutexLock lock(treeMutex);                                           \
-      flushCache();                                                            \
+      cache->flush();                                                          \
       overTime.reset(i_get_tbl##ot(sampleType, &overTimeCount, true));         \
     }                                                                          \
     *count = 0;                                                                \

@@ -1,6 +1,9 @@
 // Processing one transaction: the patterns it matches decide whether and under which names it
 // counts; it then updates the over-time trees (of its own interval, swapping a past interval
-// in when needed) and, by instance level, the instance files. The order of the steps matters.
+// in when needed) and, by instance level, the instance files. The order of the steps matters:
+// restamp a record too old for the reference interval, skip what the collector did not sample,
+// match the patterns, then for each matched pair rename the working copy after its patterns,
+// pick the trees of its interval, update them and, by instance level, the instance files.
 
 #include <cstring>
 #include <memory>
@@ -66,42 +69,17 @@ void ToSubnet(char* text, size_t size) {
   text[length] = '\0';
 }
 
-}  // namespace
-
-void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* instanceLevel) {
-  // 1. A transaction too old for the reference interval is counted into it. The interval is
-  // taken in minutes as if they were seconds: that is how old records have always been judged.
-  const long recorded = transaction.getTimeRecorded();
-  const long m = CConfig::getOverTimeInterval();
-  const long s = recorded - (recorded % m) - m;
-  if (s < referenceInterval) {
-    transaction.setTimeRecorded(referenceInterval);
-    ++oldTransactions;
-  }
-  ++transactionsReceived;
-
-  // 2.
-  const int64_t started = QbrmBestGetCurrentTime();
-
-  // 3.
-  if ((transaction.getControlFlags() & 4) != 0) {
-    CLOG::max("Transaction did not match a Pattern or was not sampled. Ignoring...");
-    ++transactionsIgnored;
-    return;
-  }
-
-  // 4-5. Page or sub-transaction, and the matches that decide its names.
-  const bool page = transaction.getParentUUID()[0] == '\0';
-  CSituationController& controller = situations();
-  TransactionMatch* txMatches = nullptr;
-  ClientMatch* clientMatches = nullptr;
-  // The made-up matches of an object and of a client no pattern names: built once, since a
-  // match record is over a kilobyte to clear.
+// The made-up matches of an object and of a client no pattern names: built once, since a
+// match record is over a kilobyte to clear.
+const ClientMatch& OwnClientIdentity() {
   static const ClientMatch kOwnIdentity = [] {
     ClientMatch m;
     m.pattern.aggregateUniquely = 1;
     return m;
   }();
+  return kOwnIdentity;
+}
+const TransactionMatch& ObjectMatch() {
   static const TransactionMatch kObjectMatch = [] {
     TransactionMatch m;
     m.pattern.aggappsuniq = 1;
@@ -109,6 +87,137 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
     m.pattern.samplePercent = 100;
     return m;
   }();
+  return kObjectMatch;
+}
+
+// The instance level and importance of one matched pair: the pattern's, except for a
+// sub-transaction record, whose control flags carry its own.
+struct InstanceChoice {
+  int level;
+  int importance;
+};
+InstanceChoice ChooseInstanceLevel(const CDPXTransaction& t, const TransactionPattern& tp) {
+  if (t.getTrueTransType() == static_cast<int>(TRANSACTION_KIND_SUBTX)) {
+    return {t.getControlFlags() & 3, (t.getControlFlags() >> 8) & 255};
+  }
+  return {tp.collectInstances, tp.importance};
+}
+
+// Renames w after the transaction pattern unless the pattern keeps its names apart; returns the
+// aggby bits of the names kept.
+int ApplyTransactionPattern(CDPXTransaction& w, const TransactionPattern& tp, int importance) {
+  int aggBy = 0;
+  if (tp.aggappsuniq != 0) {
+    aggBy |= kAggByApplication;
+  } else {
+    w.setApplicationName(tp.applicationName);
+  }
+  if (tp.aggtxsuniq != 0) {
+    aggBy |= kAggByTransaction;
+  } else {
+    w.setTransactionName(tp.transactionName);
+  }
+  w.setImportance(importance);
+  w.setMinThreshold(tp.mrtthres);
+  return aggBy;
+}
+
+// Renames w's client after the client pattern: kept apart (aggby bit), folded into the
+// pattern's name, or cut to its subnet. Returns the aggby bit it adds.
+int ApplyClientPattern(CDPXTransaction& w, const ClientPattern& cp) {
+  if (cp.aggregateUniquely == 1) {
+    return kAggByClient;
+  }
+  if (cp.aggregateUniquely == 0) {
+    w.setClientName(cp.clientName);
+    w.setClientHostname(cp.clientName);
+    w.setClientIPAddress(cp.clientName);
+    return 0;
+  }
+  char text[kTransactionNameWidth];
+  snprintf(text, sizeof(text), "%s", w.getClientName());
+  ToSubnet(text, sizeof(text));
+  w.setClientName(text);
+  snprintf(text, sizeof(text), "%s", w.getClientHostname());
+  ToSubnet(text, sizeof(text));
+  w.setClientHostname(text);
+  snprintf(text, sizeof(text), "%s", w.getClientIPAddress());
+  ToSubnet(text, sizeof(text));
+  w.setClientIPAddress(text);
+  snprintf(text, sizeof(text), "%s", w.getClientIPv6Address());
+  ToSubnet(text, sizeof(text));
+  w.setClientIPv6Address(text);
+  return 0;
+}
+
+}  // namespace
+
+// A transaction too old for the reference interval is counted into it. The interval is taken in
+// minutes as if they were seconds: that is how old records have always been judged.
+void CDPXAnalyzer::restampIfTooOld(CDPXTransaction& transaction) {
+  const long recorded = transaction.getTimeRecorded();
+  const long m = CConfig::getOverTimeInterval();
+  const long s = recorded - (recorded % m) - m;
+  if (s < referenceInterval) {
+    transaction.setTimeRecorded(referenceInterval);
+    ++oldTransactions;
+  }
+}
+
+// Makes the trees of interval-start t the ones processing updates: the current interval's, or
+// a past interval's swapped in as the cache.
+void CDPXAnalyzer::selectTreesFor(long t) {
+  if (!cache->active() && t >= getCurrentOverTimeInterval()) {
+    return;
+  }
+  if (cache->active() && t >= referenceInterval) {
+    cache->deactivate(getCurrentOverTimeInterval());
+    return;
+  }
+  const long m = CConfig::getOverTimeInterval();
+  const long interval = t - (t % (m * 60));
+  if (cache->active() && cache->interval() != interval) {
+    cache->deactivate(getCurrentOverTimeInterval());
+  }
+  if (!cache->active()) {
+    cache->activate(interval, getCurrentOverTimeInterval());
+  }
+  CLOG::med("%s Processing transaction from a previous time period",
+            "CDPXAnalyzer::processTransaction");
+}
+
+// Appends w's instance row to the page or sub-transaction instance file.
+void CDPXAnalyzer::recordInstance(CDPXTransaction& w, bool page, const InstancePatterns& names) {
+  if (page) {
+    kq7_q7txins_data_t row;
+    buildInstanceRow(w, names, row);
+    instanceFile->append(getCurrentOverTimeInterval(), &row);
+  } else {
+    kq7_q7subtxins_data_t row;
+    buildInstanceRow(w, names, row);
+    subInstanceFile->append(getCurrentOverTimeInterval(), &row);
+  }
+}
+
+void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* instanceLevel) {
+  const long recorded = transaction.getTimeRecorded();
+  restampIfTooOld(transaction);
+  ++transactionsReceived;
+  const int64_t started = QbrmBestGetCurrentTime();
+
+  // The collector marks records it did not sample.
+  if ((transaction.getControlFlags() & 4) != 0) {
+    CLOG::max("Transaction did not match a Pattern or was not sampled. Ignoring...");
+    ++transactionsIgnored;
+    return;
+  }
+
+  // Matching: a page by the patterns; an object of a page counts under its own names, at the
+  // instance level of the page before it.
+  const bool page = transaction.getParentUUID()[0] == '\0';
+  CSituationController& controller = situations();
+  TransactionMatch* txMatches = nullptr;
+  ClientMatch* clientMatches = nullptr;
   std::optional<TransactionMatch> madeUpTx;
   bool madeUp = false;
   if (page) {
@@ -121,148 +230,82 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
       *instanceLevel = txMatches->pattern.collectInstances;
     }
   } else {
-    // An object of a page counts under its own names, at the level of the page before it.
     madeUp = true;
-    madeUpTx.emplace(kObjectMatch);
+    madeUpTx.emplace(ObjectMatch());
     madeUpTx->pattern.collectInstances = *instanceLevel;
     txMatches = &*madeUpTx;
-    clientMatches = const_cast<ClientMatch*>(&kOwnIdentity);
+    clientMatches = const_cast<ClientMatch*>(&OwnClientIdentity());
   }
-
-  // 6.
   CLOG::med("Processing transaction tTemp[%p] appName[%s] tranName[%s]",
             static_cast<void*>(&transaction), transaction.getApplicationName(),
             transaction.getTransactionName());
-
-  // 9.
   if (txMatches == nullptr) {
     CLOG::max("Transaction did not match a Pattern or was not sampled. Ignoring...");
     ++transactionsIgnored;
     controller.freeClientMatches(clientMatches);
     return;
   }
-
-  // 7.
   if (clientMatches == nullptr) {
     CLOG::med("Transaction did not match a client pattern.");
   }
+
+  // Every pair of matched patterns counts once.
   const bool onePair =
       txMatches->next == nullptr && (clientMatches == nullptr || clientMatches->next == nullptr);
+  const ClientMatch* const firstClient =
+      clientMatches != nullptr ? clientMatches : &OwnClientIdentity();
   for (const TransactionMatch* tm = txMatches; tm != nullptr; tm = tm->next) {
     const TransactionPattern& tp = tm->pattern;
-    for (const ClientMatch* cm = clientMatches != nullptr ? clientMatches : &kOwnIdentity;
-         cm != nullptr; cm = cm->next) {
+    for (const ClientMatch* cm = firstClient; cm != nullptr; cm = cm->next) {
       const ClientPattern& cp = cm->pattern;
-      // a.
-      int level = tp.collectInstances;
-      int importance = tp.importance;
-      if (transaction.getTrueTransType() == static_cast<int>(TRANSACTION_KIND_SUBTX)) {
-        level = transaction.getControlFlags() & 3;
-        importance = (transaction.getControlFlags() >> 8) & 255;
-      }
-      // b. The analyzer asks for the first match only, so there is one pair and the record
-      // itself can be the working copy; a copy (4.6 KB) is made only when more pairs follow.
+      const InstanceChoice instance = ChooseInstanceLevel(transaction, tp);
+      // The analyzer asks for the first match only, so there is one pair and the record itself
+      // can be the working copy; a copy (4.6 KB) is made only when more pairs follow.
       std::unique_ptr<CDPXTransaction> copy;
       if (!onePair) {
         copy = std::make_unique<CDPXTransaction>(transaction);
       }
       CDPXTransaction& w = copy ? *copy : transaction;
-      int aggBy = 0;
-      if (tp.aggappsuniq != 0) {
-        aggBy |= kAggByApplication;
-      } else {
-        w.setApplicationName(tp.applicationName);
-      }
-      if (tp.aggtxsuniq != 0) {
-        aggBy |= kAggByTransaction;
-      } else {
-        w.setTransactionName(tp.transactionName);
-      }
-      w.setImportance(importance);
-      w.setMinThreshold(tp.mrtthres);
-      // c.
-      if (cp.aggregateUniquely == 1) {
-        aggBy |= kAggByClient;
-      } else if (cp.aggregateUniquely == 0) {
-        w.setClientName(cp.clientName);
-        w.setClientHostname(cp.clientName);
-        w.setClientIPAddress(cp.clientName);
-      } else {
-        char text[kTransactionNameWidth];
-        snprintf(text, sizeof(text), "%s", w.getClientName());
-        ToSubnet(text, sizeof(text));
-        w.setClientName(text);
-        snprintf(text, sizeof(text), "%s", w.getClientHostname());
-        ToSubnet(text, sizeof(text));
-        w.setClientHostname(text);
-        snprintf(text, sizeof(text), "%s", w.getClientIPAddress());
-        ToSubnet(text, sizeof(text));
-        w.setClientIPAddress(text);
-        snprintf(text, sizeof(text), "%s", w.getClientIPv6Address());
-        ToSubnet(text, sizeof(text));
-        w.setClientIPv6Address(text);
-      }
-      // d.
+      int aggBy = ApplyTransactionPattern(w, tp, instance.importance);
+      aggBy |= ApplyClientPattern(w, cp);
       w.setAggBy(aggBy);
       CLOG::med("Transaction matched a defined pattern. Processing....");
 
-      // e.
-      Lock();
-      const long now = fw::Now();
-      if (w.getTimeRecorded() > now - static_cast<long>(CConfig::getSummaryInterval()) * 3600) {
-        // f. The trees of the transaction's interval.
-        const long t = w.getTimeRecorded();
-        if (!cacheActive && t >= getCurrentOverTimeInterval()) {
-          // the current trees
-        } else if (cacheActive && t >= referenceInterval) {
-          deactivateCache();
-        } else {
-          const long interval = t - (t % (m * 60));
-          if (cacheActive && cacheInterval != interval) {
-            deactivateCache();
-          }
-          if (!cacheActive) {
-            activateCache(t);
-          }
-          CLOG::med("%s Processing transaction from a previous time period",
-                    "CDPXAnalyzer::processTransaction");
-        }
-        if (page) {
-          UpdatePageTables(*trees, w);
-        }
-        if (level == 1 || (level == 2 && w.isBadStatusCode())) {
-          CLOG::med("Transaction Instance Trace [%d], sending to instance tables ...", level);
-          w.setTimeRecorded(recorded);
-          InstancePatterns names;
-          if (!madeUp) {
-            names = {tp.applicationPattern, tp.transactionPattern,
-                     cm == &kOwnIdentity ? "" : cp.clientName,
-                     cm == &kOwnIdentity ? "" : cp.hostNamePattern,
-                     cm == &kOwnIdentity ? "" : cp.ipAddressPattern};
-          }
+      int64_t elapsed = 0;
+      {
+        CvelMutexLock lock(treeMutex);
+        const long now = fw::Now();
+        // Transactions older than the summary period count nowhere.
+        if (w.getTimeRecorded() > now - static_cast<long>(CConfig::getSummaryInterval()) * 3600) {
+          selectTreesFor(w.getTimeRecorded());
           if (page) {
-            kq7_q7txins_data_t row;
-            buildInstanceRow(w, names, row);
-            instanceFile->append(getCurrentOverTimeInterval(), &row);
-          } else {
-            kq7_q7subtxins_data_t row;
-            buildInstanceRow(w, names, row);
-            subInstanceFile->append(getCurrentOverTimeInterval(), &row);
+            UpdatePageTables(cache->trees(), w);
+          }
+          const int level = instance.level;
+          if (level == 1 || (level == 2 && w.isBadStatusCode())) {
+            CLOG::med("Transaction Instance Trace [%d], sending to instance tables ...", level);
+            w.setTimeRecorded(recorded);
+            InstancePatterns names;
+            if (!madeUp) {
+              const bool ownIdentity = cm == &OwnClientIdentity();
+              names = {tp.applicationPattern, tp.transactionPattern,
+                       ownIdentity ? "" : cp.clientName, ownIdentity ? "" : cp.hostNamePattern,
+                       ownIdentity ? "" : cp.ipAddressPattern};
+            }
+            recordInstance(w, page, names);
+          }
+          if (!page) {
+            UpdateTable<CSubTransactionOverTime>(
+                cache->trees().tree(OverTimeTable::kSubTransaction), w,
+                "Error adding to CSTOT tree!");
           }
         }
-        if (!page) {
-          UpdateTable<CSubTransactionOverTime>(trees->tree(OverTimeTable::kSubTransaction), w,
-                                               "Error adding to CSTOT tree!");
-        }
+        elapsed = QbrmBestGetCurrentTime() - started;
       }
-      // g.
-      const int64_t elapsed = QbrmBestGetCurrentTime() - started;
-      Unlock();
       ++transactionsProcessed;
       totalProcessingTime += elapsed / 1000000;
     }
   }
-  // 8.
   if (!madeUp) {
     controller.freeTransactionMatches(txMatches);
     controller.freeClientMatches(clientMatches);
