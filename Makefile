@@ -5,7 +5,8 @@
 #   make demo     build, lay out a demo home in demo-home/ and run the agent in the foreground
 #   make bench    Release build of the benchmarks, then run them
 #   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/
-#   make asan / make tsan   sanitizer builds with their unit tests
+#   make asan / make tsan   sanitizer builds with their unit tests (asan: clang, with the
+#                           thread-safety analysis)
 #   make test-tsan          the concurrency tests (runtime, situations, analyzer) under TSan
 #   make fuzz     clang libFuzzer builds of the record parser, the HTTP parser and the capture
 #                 pipeline, each run for FUZZ_SECONDS (default 60)
@@ -51,9 +52,16 @@ test: build
 	$(MAKE) --no-print-directory asan
 	$(MAKE) --no-print-directory test-tsan
 
+# The ASan+UBSan build is also the Clang thread-safety build (-Wthread-safety with -Werror). A
+# cache configured with another compiler is dropped first: CMake cannot switch it in place.
 asan: deps
+	@if [ -f build-asan/CMakeCache.txt ] && \
+	    ! grep -q '^CMAKE_CXX_COMPILER:[A-Z]*=\(.*/\)\?clang++$$' build-asan/CMakeCache.txt; then \
+	  echo "build-asan was configured with another compiler: configuring it afresh"; \
+	  rm -rf build-asan/CMakeCache.txt build-asan/CMakeFiles; \
+	fi
 	cmake -S . -B build-asan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_SANITIZE=ON \
-	  -DQ7_BUILD_E2E=OFF -DQ7_BUILD_BENCH=OFF
+	  -DCMAKE_C_COMPILER=clang -DCMAKE_CXX_COMPILER=clang++ -DQ7_BUILD_E2E=OFF -DQ7_BUILD_BENCH=OFF
 	cmake --build build-asan -j $(JOBS)
 	cd build-asan && ctest --output-on-failure -j $(JOBS) -L unit --timeout 300
 
@@ -66,14 +74,14 @@ tsan: deps
 # The concurrency code under ThreadSanitizer (part of make test): the runtime primitives, the
 # situation controller shared by framework threads and the analyzer, the analyzer thread, the
 # intake threads (data file monitors and the file manager), the framework's event rings,
-# event streams and situations, and the collector process monitors.
+# event streams, situations and condition waits, and the collector process monitors.
 test-tsan: deps
 	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON \
 	  -DQ7_BUILD_E2E=OFF -DQ7_BUILD_BENCH=OFF
 	cmake --build build-tsan -j $(JOBS) --target runtime_test analyzer_test framework_test tama_test
 	build-tsan/bin/runtime_test --gtest_brief=1
 	build-tsan/bin/tama_test --gtest_brief=1 --gtest_filter='ServiceMonitor*'
-	build-tsan/bin/framework_test --gtest_brief=1 --gtest_filter='Events*:Situations*'
+	build-tsan/bin/framework_test --gtest_brief=1 --gtest_filter='Events*:Situations*:CondVar*'
 	build-tsan/bin/analyzer_test --gtest_brief=1 --gtest_filter='Situation*:Processing*:WaitFor*:DataFileMonitor*:FileManager*'
 
 bench: deps

@@ -287,7 +287,10 @@ TEST_F(Sm3ctlTest, ProgramsStopThoughStartedWithStopSignalsBlocked) {
                       std::chrono::seconds(5)));
   ASSERT_TRUE(WaitFor([&] { return fs::file_size(root_.file("direct/traffic.sm3")) > 0; },
                       std::chrono::seconds(5)));
-  for (const auto& [pid, signal] : {std::pair{gen, SIGINT}, std::pair{writer, SIGTERM}}) {
+  for (const auto& stop : {std::pair{gen, SIGINT}, std::pair{writer, SIGTERM}}) {
+    // Plain variables, not a structured binding: clang 14's lambdas cannot capture one.
+    const pid_t pid = stop.first;
+    const int signal = stop.second;
     kill(pid, signal);
     int status = -1;
     const bool ended =

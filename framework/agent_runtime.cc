@@ -4,10 +4,10 @@
 
 #include <algorithm>
 #include <cstring>
-#include <mutex>
 #include <utility>
 
 #include "framework/environment.h"
+#include "framework/mutex.h"
 #include "framework/runtime_state.h"
 #include "framework/status.h"
 #include "framework/trace.h"
@@ -27,7 +27,7 @@ RuntimeState& State() {
 }
 
 void RegisterAgentLoader(AgentLoader loader) {
-  std::lock_guard<std::mutex> lock(State().mutex);
+  MutexLock lock(State().mutex);
   State().loader = loader;
 }
 
@@ -35,7 +35,7 @@ void RegisterCommandCallback(const char* prefix, CommandCallback callback) {
   if (prefix == nullptr || callback == nullptr) {
     return;
   }
-  std::lock_guard<std::mutex> lock(State().mutex);
+  MutexLock lock(State().mutex);
   State().commands.emplace_back(prefix, callback);
 }
 
@@ -45,7 +45,7 @@ int DispatchCommand(CtunaAutomationCapsule* capsule) {
   }
   CommandCallback callback = nullptr;
   {
-    std::lock_guard<std::mutex> lock(State().mutex);
+    MutexLock lock(State().mutex);
     for (const auto& [prefix, cb] : State().commands) {
       if (capsule->command.compare(0, prefix.size(), prefix) == 0) {
         callback = cb;
@@ -75,13 +75,13 @@ int SetNodeTypeFromProductCode(const char* product_code) {
   if (product_code == nullptr || std::strcmp(product_code, "Q7") != 0) {
     return kInvalidArgument;
   }
-  std::lock_guard<std::mutex> lock(State().mutex);
+  MutexLock lock(State().mutex);
   State().node_type = product_code;
   return kOk;
 }
 
 std::string NodeType() {
-  std::lock_guard<std::mutex> lock(State().mutex);
+  MutexLock lock(State().mutex);
   return State().node_type;
 }
 
@@ -93,13 +93,13 @@ int SetHostName(const char* name) {
   if (name == nullptr) {
     return kInvalidArgument;
   }
-  std::lock_guard<std::mutex> lock(State().mutex);
+  MutexLock lock(State().mutex);
   State().host_name = name;
   return kOk;
 }
 
 std::string HostName() {
-  std::lock_guard<std::mutex> lock(State().mutex);
+  MutexLock lock(State().mutex);
   return State().host_name;
 }
 
@@ -107,13 +107,13 @@ int DeclareAffinity(const char* affinity) {
   if (affinity == nullptr || *affinity == '\0') {
     return kInvalidArgument;
   }
-  std::lock_guard<std::mutex> lock(State().mutex);
+  MutexLock lock(State().mutex);
   State().affinities.emplace_back(affinity);
   return kOk;
 }
 
 std::vector<std::string> Affinities() {
-  std::lock_guard<std::mutex> lock(State().mutex);
+  MutexLock lock(State().mutex);
   return State().affinities;
 }
 
@@ -137,44 +137,44 @@ std::string OriginNodeName() {
 int Uname(struct utsname* out) {
   std::function<int(struct utsname*)> fn;
   {
-    std::lock_guard<std::mutex> lock(State().mutex);
+    MutexLock lock(State().mutex);
     fn = State().uname;
   }
   return fn ? fn(out) : ::uname(out);
 }
 
 void SetUnameForTesting(std::function<int(struct utsname*)> fn) {
-  std::lock_guard<std::mutex> lock(State().mutex);
+  MutexLock lock(State().mutex);
   State().uname = std::move(fn);
 }
 
 void RequestShutdown(int reason) {
   Q7_TRACE(kUnit, kTraceSummary, "shutdown requested (reason %d)", reason);
   {
-    std::lock_guard<std::mutex> lock(State().shutdown_mutex);
+    MutexLock lock(State().shutdown_mutex);
     State().shutdown_requested = true;
   }
-  State().shutdown_cv.notify_all();
+  State().shutdown_cv.NotifyAll();
 }
 
 bool ShutdownRequested() {
-  std::lock_guard<std::mutex> lock(State().shutdown_mutex);
+  MutexLock lock(State().shutdown_mutex);
   return State().shutdown_requested;
 }
 
 void SetHealthProvider(std::function<void(nlohmann::json&)> provider) {
-  std::lock_guard<std::mutex> lock(State().mutex);
+  MutexLock lock(State().mutex);
   State().health_provider = std::move(provider);
 }
 
 void SetAgentInfoProvider(std::function<void(nlohmann::json&)> provider) {
-  std::lock_guard<std::mutex> lock(State().mutex);
+  MutexLock lock(State().mutex);
   State().info_provider = std::move(provider);
 }
 
 void ResetRuntimeForTesting() {
   {
-    std::lock_guard<std::mutex> lock(State().mutex);
+    MutexLock lock(State().mutex);
     State().loader = nullptr;
     State().commands.clear();
     State().node_type.clear();
@@ -184,7 +184,7 @@ void ResetRuntimeForTesting() {
     State().health_provider = nullptr;
     State().info_provider = nullptr;
   }
-  std::lock_guard<std::mutex> lock(State().shutdown_mutex);
+  MutexLock lock(State().shutdown_mutex);
   State().shutdown_requested = false;
 }
 

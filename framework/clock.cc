@@ -3,14 +3,15 @@
 #include <atomic>
 #include <cstdio>
 #include <cstring>
-#include <mutex>
 #include <utility>
+
+#include "framework/mutex.h"
 
 namespace fw {
 namespace {
 
-std::mutex g_clock_mutex;
-std::function<time_t()> g_clock;  // guarded by g_clock_mutex; empty: time()
+constinit Mutex g_clock_mutex;
+std::function<time_t()> g_clock GUARDED_BY(g_clock_mutex);  // empty: time()
 // Lets Now() skip the lock in production, where no clock is ever injected.
 std::atomic<bool> g_clock_injected{false};
 
@@ -18,7 +19,7 @@ std::atomic<bool> g_clock_injected{false};
 
 time_t Now() {
   if (g_clock_injected.load(std::memory_order_acquire)) {
-    std::lock_guard<std::mutex> lock(g_clock_mutex);
+    MutexLock lock(g_clock_mutex);
     if (g_clock) {
       return g_clock();
     }
@@ -27,7 +28,7 @@ time_t Now() {
 }
 
 void SetClockForTesting(std::function<time_t()> clock) {
-  std::lock_guard<std::mutex> lock(g_clock_mutex);
+  MutexLock lock(g_clock_mutex);
   g_clock = std::move(clock);
   g_clock_injected.store(static_cast<bool>(g_clock), std::memory_order_release);
 }

@@ -5,6 +5,7 @@
 #include <map>
 #include <utility>
 
+#include "framework/mutex.h"
 #include "framework/status.h"
 
 namespace fw {
@@ -19,12 +20,12 @@ std::string Key(std::string_view table) {
 }
 
 struct EventHub {
-  // mutex guards everything below. Rows are delivered to subscriptions while it is held, so
-  // every subscriber sees rows in sequence order.
-  std::mutex mutex;
-  std::map<std::string, std::deque<EventRow>> rings;  // by upper-case table name
-  std::vector<std::weak_ptr<EventSubscription>> subscriptions;
-  std::uint64_t last_sequence = 0;
+  // Rows are delivered to subscriptions while mutex is held, so every subscriber sees rows in
+  // sequence order.
+  Mutex mutex;
+  std::map<std::string, std::deque<EventRow>> rings GUARDED_BY(mutex);  // by upper-case name
+  std::vector<std::weak_ptr<EventSubscription>> subscriptions GUARDED_BY(mutex);
+  std::uint64_t last_sequence GUARDED_BY(mutex) = 0;
 };
 
 // A function-local static, so rows may be pushed during start-up before anything else runs.
@@ -40,7 +41,7 @@ int PushEventRows(std::string_view table, const void* rows, std::size_t row_size
     return kInvalidArgument;
   }
   EventHub& hub = Hub();
-  std::lock_guard<std::mutex> lock(hub.mutex);
+  MutexLock lock(hub.mutex);
   std::deque<EventRow>& ring = hub.rings[Key(table)];
   // Drop subscriptions whose owners are gone before delivering to the rest.
   std::vector<std::shared_ptr<EventSubscription>> live;
@@ -72,7 +73,7 @@ int PushEventRows(std::string_view table, const void* rows, std::size_t row_size
 
 std::vector<EventRow> ListEventRows(std::string_view table) {
   EventHub& hub = Hub();
-  std::lock_guard<std::mutex> lock(hub.mutex);
+  MutexLock lock(hub.mutex);
   const auto it = hub.rings.find(Key(table));
   if (it == hub.rings.end()) {
     return {};
@@ -84,7 +85,7 @@ std::vector<EventRow> ListAllEventRows() {
   std::vector<EventRow> all;
   {
     EventHub& hub = Hub();
-    std::lock_guard<std::mutex> lock(hub.mutex);
+    MutexLock lock(hub.mutex);
     for (const auto& [name, ring] : hub.rings) {
       all.insert(all.end(), ring.begin(), ring.end());
     }
@@ -97,20 +98,20 @@ std::vector<EventRow> ListAllEventRows() {
 std::shared_ptr<EventSubscription> SubscribeEvents() {
   std::shared_ptr<EventSubscription> subscription(new EventSubscription());
   EventHub& hub = Hub();
-  std::lock_guard<std::mutex> lock(hub.mutex);
+  MutexLock lock(hub.mutex);
   hub.subscriptions.push_back(subscription);
   return subscription;
 }
 
 void ResetEventsForTesting() {
   EventHub& hub = Hub();
-  std::lock_guard<std::mutex> lock(hub.mutex);
+  MutexLock lock(hub.mutex);
   hub.rings.clear();
 }
 
 void EventSubscription::Deliver(const EventRow& row) {
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    MutexLock lock(mutex_);
     if (closed_) {
       return;
     }
@@ -119,12 +120,13 @@ void EventSubscription::Deliver(const EventRow& row) {
       waiting_.pop_front();
     }
   }
-  ready_.notify_all();
+  ready_.NotifyAll();
 }
 
 bool EventSubscription::Next(EventRow* row, std::chrono::milliseconds timeout) {
-  std::unique_lock<std::mutex> lock(mutex_);
-  ready_.wait_for(lock, timeout, [this] { return closed_ || !waiting_.empty(); });
+  MutexLock lock(mutex_);
+  ready_.WaitFor(mutex_, timeout,
+                 [this]() REQUIRES(mutex_) { return closed_ || !waiting_.empty(); });
   if (closed_ || waiting_.empty()) {
     return false;
   }
@@ -135,15 +137,15 @@ bool EventSubscription::Next(EventRow* row, std::chrono::milliseconds timeout) {
 
 void EventSubscription::Close() {
   {
-    std::lock_guard<std::mutex> lock(mutex_);
+    MutexLock lock(mutex_);
     closed_ = true;
     waiting_.clear();
   }
-  ready_.notify_all();
+  ready_.NotifyAll();
 }
 
 bool EventSubscription::closed() const {
-  std::lock_guard<std::mutex> lock(mutex_);
+  MutexLock lock(mutex_);
   return closed_;
 }
 

@@ -12,15 +12,15 @@
 // thread.
 
 #include <chrono>
-#include <condition_variable>
 #include <cstddef>
 #include <cstdint>
 #include <deque>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <string_view>
 #include <vector>
+
+#include "framework/mutex.h"
 
 namespace fw {
 
@@ -68,10 +68,10 @@ class EventSubscription {
   EventSubscription() = default;
   void Deliver(const EventRow& row);
 
-  mutable std::mutex mutex_;
-  std::condition_variable ready_;
-  std::deque<EventRow> waiting_;  // guarded by mutex_
-  bool closed_ = false;           // guarded by mutex_
+  mutable Mutex mutex_;
+  CondVar ready_;
+  std::deque<EventRow> waiting_ GUARDED_BY(mutex_);
+  bool closed_ GUARDED_BY(mutex_) = false;
 };
 
 // Opens a subscription to rows of every table pushed from now on.

@@ -3,11 +3,9 @@
 #include <httplib.h>
 
 #include <chrono>
-#include <condition_variable>
 #include <cstddef>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <string>
@@ -16,6 +14,7 @@
 
 #include "framework/events.h"
 #include "framework/http_json.h"
+#include "framework/mutex.h"
 #include "framework/sample_query.h"
 #include "framework/status.h"
 #include "framework/table_sample.h"
@@ -38,17 +37,17 @@ constexpr auto kStreamEndWait = 1s;
 
 // The streams of one server.
 struct StreamControl {
-  std::mutex mutex;               // guards everything below
-  std::condition_variable ended;  // notified when a stream goes away
-  bool ending = false;
-  int open = 0;
-  std::vector<std::weak_ptr<EventSubscription>> subscriptions;
+  Mutex mutex;
+  CondVar ended;  // notified when a stream goes away
+  bool ending GUARDED_BY(mutex) = false;
+  int open GUARDED_BY(mutex) = 0;
+  std::vector<std::weak_ptr<EventSubscription>> subscriptions GUARDED_BY(mutex);
 };
 
 // The stream controls by server, so EndEventStreams finds them without the server's help.
 struct Controls {
-  std::mutex mutex;  // guards by_server
-  std::map<const httplib::Server*, std::shared_ptr<StreamControl>> by_server;
+  Mutex mutex;
+  std::map<const httplib::Server*, std::shared_ptr<StreamControl>> by_server GUARDED_BY(mutex);
 };
 
 Controls& TheControls() {
@@ -105,7 +104,7 @@ void ServeStream(const std::shared_ptr<StreamControl>& control, httplib::Respons
   // Subscribe before answering, so no row pushed from here on is missed.
   std::shared_ptr<EventSubscription> subscription;
   {
-    std::lock_guard<std::mutex> lock(control->mutex);
+    MutexLock lock(control->mutex);
     if (control->ending) {
       ReplyError(res, 503, "the server is stopping");
       return;
@@ -149,10 +148,10 @@ void ServeStream(const std::shared_ptr<StreamControl>& control, httplib::Respons
       [control, subscription](bool /*success*/) {
         subscription->Close();
         {
-          std::lock_guard<std::mutex> lock(control->mutex);
+          MutexLock lock(control->mutex);
           --control->open;
         }
-        control->ended.notify_all();
+        control->ended.NotifyAll();
         Q7_TRACE(kUnit, kTraceDetail, "event stream closed");
       });
 }
@@ -163,7 +162,7 @@ void InstallEventRoutes(httplib::Server& server) {
   auto control = std::make_shared<StreamControl>();
   {
     Controls& controls = TheControls();
-    std::lock_guard<std::mutex> lock(controls.mutex);
+    MutexLock lock(controls.mutex);
     controls.by_server[&server] = control;
   }
   server.Get("/api/v1/events", ServeEvents);
@@ -176,7 +175,7 @@ void EndEventStreams(httplib::Server& server) {
   std::shared_ptr<StreamControl> control;
   {
     Controls& controls = TheControls();
-    std::lock_guard<std::mutex> lock(controls.mutex);
+    MutexLock lock(controls.mutex);
     const auto it = controls.by_server.find(&server);
     if (it == controls.by_server.end()) {
       return;
@@ -184,7 +183,7 @@ void EndEventStreams(httplib::Server& server) {
     control = std::move(it->second);
     controls.by_server.erase(it);
   }
-  std::unique_lock<std::mutex> lock(control->mutex);
+  MutexLock lock(control->mutex);
   control->ending = true;
   for (const auto& weak : control->subscriptions) {
     if (auto subscription = weak.lock()) {
@@ -195,7 +194,8 @@ void EndEventStreams(httplib::Server& server) {
   // Each stream, woken by its closed subscription, writes the end of its chunked reply; the
   // server's stop would otherwise shut the socket under a stream about to end cleanly. A client
   // that does not read is not waited for beyond the bound.
-  control->ended.wait_for(lock, kStreamEndWait, [&control] { return control->open == 0; });
+  control->ended.WaitFor(control->mutex, kStreamEndWait,
+                         [&control]() REQUIRES(control->mutex) { return control->open == 0; });
 }
 
 }  // namespace fw

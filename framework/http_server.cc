@@ -16,6 +16,7 @@
 #include "framework/api_token.h"
 #include "framework/http_json.h"
 #include "framework/events_api.h"
+#include "framework/mutex.h"
 #include "framework/runtime_state.h"
 #include "framework/sample_query.h"
 #include "framework/situations_api.h"
@@ -46,7 +47,7 @@ nlohmann::json AgentInfo() {
   info["uptime_seconds"] = uptime.count();
   std::function<void(nlohmann::json&)> provider;
   {
-    std::lock_guard<std::mutex> lock(State().mutex);
+    MutexLock lock(State().mutex);
     provider = State().info_provider;
   }
   if (provider) {
@@ -59,7 +60,7 @@ nlohmann::json Health() {
   nlohmann::json health{{"status", "ok"}};
   std::function<void(nlohmann::json&)> provider;
   {
-    std::lock_guard<std::mutex> lock(State().mutex);
+    MutexLock lock(State().mutex);
     provider = State().health_provider;
   }
   if (provider) {

@@ -12,6 +12,7 @@
 #include "framework/atomic_file.h"
 #include "framework/environment.h"
 #include "framework/http_server.h"
+#include "framework/mutex.h"
 #include "framework/runtime_state.h"
 #include "framework/situations.h"
 #include "framework/status.h"
@@ -47,7 +48,7 @@ int kunmain(int /*argc*/, char** /*argv*/) {
   Q7_FLOW(kUnit);
   fw::AgentLoader loader = nullptr;
   {
-    std::lock_guard<std::mutex> lock(fw::State().mutex);
+    fw::MutexLock lock(fw::State().mutex);
     loader = fw::State().loader;
   }
   if (loader != nullptr) {
@@ -96,8 +97,11 @@ int kunmain(int /*argc*/, char** /*argv*/) {
   }
 
   {
-    std::unique_lock<std::mutex> lock(fw::State().shutdown_mutex);
-    fw::State().shutdown_cv.wait(lock, [] { return fw::State().shutdown_requested; });
+    fw::RuntimeState& state = fw::State();
+    fw::MutexLock lock(state.shutdown_mutex);
+    state.shutdown_cv.Wait(state.shutdown_mutex, [&state]() REQUIRES(state.shutdown_mutex) {
+      return state.shutdown_requested;
+    });
   }
   Q7_TRACE(kUnit, fw::kTraceSummary, "main loop leaving: stopping the HTTP API");
   server.Stop();

@@ -5,34 +5,33 @@
 
 #include <sys/utsname.h>
 
-#include <condition_variable>
 #include <functional>
-#include <mutex>
 #include <nlohmann/json.hpp>
 #include <string>
 #include <utility>
 #include <vector>
 
 #include "framework/agent_runtime.h"
+#include "framework/mutex.h"
 
 namespace fw {
 
 struct RuntimeState {
-  // mutex guards the registrations and identity below.
-  std::mutex mutex;
-  AgentLoader loader = nullptr;
-  std::vector<std::pair<std::string, CommandCallback>> commands;
-  std::string node_type;
-  std::string host_name;
-  std::vector<std::string> affinities;
-  std::function<int(struct utsname*)> uname;
-  std::function<void(nlohmann::json&)> health_provider;
-  std::function<void(nlohmann::json&)> info_provider;
+  // The registrations and identity.
+  Mutex mutex;
+  AgentLoader loader GUARDED_BY(mutex) = nullptr;
+  std::vector<std::pair<std::string, CommandCallback>> commands GUARDED_BY(mutex);
+  std::string node_type GUARDED_BY(mutex);
+  std::string host_name GUARDED_BY(mutex);
+  std::vector<std::string> affinities GUARDED_BY(mutex);
+  std::function<int(struct utsname*)> uname GUARDED_BY(mutex);
+  std::function<void(nlohmann::json&)> health_provider GUARDED_BY(mutex);
+  std::function<void(nlohmann::json&)> info_provider GUARDED_BY(mutex);
 
-  // shutdown_mutex guards shutdown_requested; shutdown_cv wakes the main loop.
-  std::mutex shutdown_mutex;
-  std::condition_variable shutdown_cv;
-  bool shutdown_requested = false;
+  // The shutdown request; shutdown_cv wakes the main loop.
+  Mutex shutdown_mutex;
+  CondVar shutdown_cv;
+  bool shutdown_requested GUARDED_BY(shutdown_mutex) = false;
 };
 
 RuntimeState& State();

@@ -12,11 +12,11 @@
 #include <iterator>
 #include <limits>
 #include <memory>
-#include <mutex>
 #include <nlohmann/json.hpp>
 #include <utility>
 
 #include "framework/atomic_file.h"
+#include "framework/mutex.h"
 #include "framework/row_filter.h"
 #include "framework/status.h"
 #include "framework/table_manager.h"
@@ -38,10 +38,9 @@ struct Started {
 };
 
 struct Registry {
-  std::mutex mutex;
-  // mutex guards the following.
-  std::vector<Started> started;  // in the order started
-  std::string file;              // where the list is persisted; empty: nowhere
+  Mutex mutex;
+  std::vector<Started> started GUARDED_BY(mutex);  // in the order started
+  std::string file GUARDED_BY(mutex);              // where the list is persisted; empty: nowhere
 };
 
 Registry& TheRegistry() {
@@ -88,8 +87,8 @@ bool ParseInteger(std::string_view text, std::int64_t* value) {
 }
 
 // Writes the list to the file, replaced whole: a crash leaves the old list or the new one,
-// never half of one. Registry mutex held.
-int Persist(const Registry& registry, std::string* error) {
+// never half of one.
+int Persist(const Registry& registry, std::string* error) REQUIRES(registry.mutex) {
   if (registry.file.empty()) {
     return kOk;
   }
@@ -193,7 +192,7 @@ int StartSituation(SituationInfo info, bool* replaced, std::string* error) {
     return kNotFound;
   }
   Registry& registry = TheRegistry();
-  std::lock_guard<std::mutex> lock(registry.mutex);
+  MutexLock lock(registry.mutex);
   Started fresh = Prepare(std::move(info), table);
   if (fresh.agent == nullptr) {
     *error = "table " + table->name + " cannot serve a situation";
@@ -218,7 +217,7 @@ int StartSituation(SituationInfo info, bool* replaced, std::string* error) {
 
 int StopSituation(std::string_view name, std::string* error) {
   Registry& registry = TheRegistry();
-  std::lock_guard<std::mutex> lock(registry.mutex);
+  MutexLock lock(registry.mutex);
   for (auto it = registry.started.begin(); it != registry.started.end(); ++it) {
     if (it->info.name == name) {
       Q7_TRACE(kUnit, kTraceSummary, "stopping situation %s on %s", it->info.name.c_str(),
@@ -234,7 +233,7 @@ int StopSituation(std::string_view name, std::string* error) {
 
 std::vector<SituationInfo> ListSituations() {
   Registry& registry = TheRegistry();
-  std::lock_guard<std::mutex> lock(registry.mutex);
+  MutexLock lock(registry.mutex);
   std::vector<SituationInfo> out;
   out.reserve(registry.started.size());
   for (const Started& s : registry.started) {
@@ -245,13 +244,13 @@ std::vector<SituationInfo> ListSituations() {
 
 void SetSituationsFile(const std::string& path) {
   Registry& registry = TheRegistry();
-  std::lock_guard<std::mutex> lock(registry.mutex);
+  MutexLock lock(registry.mutex);
   registry.file = path;
 }
 
 int RestoreSituations() {
   Registry& registry = TheRegistry();
-  std::lock_guard<std::mutex> lock(registry.mutex);
+  MutexLock lock(registry.mutex);
   if (registry.file.empty()) {
     return 0;
   }
@@ -319,7 +318,7 @@ int RestoreSituations() {
 
 void ResetSituations() {
   Registry& registry = TheRegistry();
-  std::lock_guard<std::mutex> lock(registry.mutex);
+  MutexLock lock(registry.mutex);
   registry.started.clear();
   registry.file.clear();
 }

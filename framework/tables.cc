@@ -2,9 +2,9 @@
 
 #include <algorithm>
 #include <cctype>
-#include <mutex>
 #include <utility>
 
+#include "framework/mutex.h"
 #include "framework/status.h"
 #include "framework/trace.h"
 
@@ -14,10 +14,10 @@ namespace {
 constexpr char kUnit[] = "tables";
 
 struct Registry {
-  // mutex guards tables. Definitions are immutable once in the list, so a caller may use a
-  // pointer it got without the lock.
-  std::mutex mutex;
-  std::vector<std::shared_ptr<const TableDefinition>> tables;  // guarded by mutex
+  // Definitions are immutable once in the list, so a caller may use a pointer it got without
+  // the lock.
+  Mutex mutex;
+  std::vector<std::shared_ptr<const TableDefinition>> tables GUARDED_BY(mutex);
 };
 
 Registry& TheRegistry() {
@@ -85,7 +85,7 @@ int RegisterTable(TableDefinition definition) {
   }
 
   Registry& registry = TheRegistry();
-  std::lock_guard<std::mutex> lock(registry.mutex);
+  MutexLock lock(registry.mutex);
   for (const auto& table : registry.tables) {
     if (SameName(table->name, definition.name)) {
       Q7_TRACE(kUnit, kTraceError, "table %s refused: it is already registered",
@@ -101,7 +101,7 @@ int RegisterTable(TableDefinition definition) {
 
 std::shared_ptr<const TableDefinition> FindTable(std::string_view name) {
   Registry& registry = TheRegistry();
-  std::lock_guard<std::mutex> lock(registry.mutex);
+  MutexLock lock(registry.mutex);
   for (const auto& table : registry.tables) {
     if (SameName(table->name, name)) {
       return table;
@@ -112,7 +112,7 @@ std::shared_ptr<const TableDefinition> FindTable(std::string_view name) {
 
 std::vector<std::shared_ptr<const TableDefinition>> ListTables() {
   Registry& registry = TheRegistry();
-  std::lock_guard<std::mutex> lock(registry.mutex);
+  MutexLock lock(registry.mutex);
   return registry.tables;
 }
 
@@ -127,7 +127,7 @@ const ColumnInfo* FindColumn(std::span<const ColumnInfo> columns, std::string_vi
 
 void ResetTablesForTesting() {
   Registry& registry = TheRegistry();
-  std::lock_guard<std::mutex> lock(registry.mutex);
+  MutexLock lock(registry.mutex);
   registry.tables.clear();
 }
 

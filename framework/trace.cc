@@ -18,11 +18,11 @@
 #include <cstring>
 #include <exception>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <utility>
 #include <vector>
 
+#include "framework/mutex.h"
 #include "framework/status.h"
 #include "framework/trace_capture.h"
 
@@ -48,12 +48,13 @@ struct MaskTable {
 // because a reader may still hold it; tables change only at start-up and in tests, so the
 // retained set stays small.
 std::atomic<const MaskTable*> g_masks{nullptr};  // null: the default (error class only)
-std::mutex g_publish_mutex;
+constinit Mutex g_publish_mutex;
 
 void PublishMasks(std::unique_ptr<MaskTable> table) {
   // Deliberately leaked so tables stay valid for threads that trace during exit.
-  static auto* retained = new std::vector<std::unique_ptr<const MaskTable>>;
-  std::lock_guard<std::mutex> lock(g_publish_mutex);
+  static auto* retained PT_GUARDED_BY(g_publish_mutex) =
+      new std::vector<std::unique_ptr<const MaskTable>>;
+  MutexLock lock(g_publish_mutex);
   const MaskTable* raw = table.get();
   retained->push_back(std::move(table));
   g_masks.store(raw, std::memory_order_release);
@@ -62,10 +63,10 @@ void PublishMasks(std::unique_ptr<MaskTable> table) {
 // The destination and the capture buffer. mu serialises every record, so records from
 // different threads never interleave and sinks can be the single-threaded kind.
 struct Writer {
-  std::mutex mu;
-  std::shared_ptr<spdlog::logger> logger;  // guarded by mu; null until first use (stderr)
-  bool capturing = false;                  // guarded by mu
-  std::vector<std::string> captured;       // guarded by mu
+  Mutex mu;
+  std::shared_ptr<spdlog::logger> logger GUARDED_BY(mu);  // null until first use (stderr)
+  bool capturing GUARDED_BY(mu) = false;
+  std::vector<std::string> captured GUARDED_BY(mu);
 };
 
 // Never destroyed: detached threads may still trace while static destructors run.
@@ -329,7 +330,7 @@ int TraceOpen(const std::string& path, std::size_t max_bytes, std::size_t max_fi
   Writer& writer = GetWriter();
   std::shared_ptr<spdlog::logger> previous;
   {
-    std::lock_guard<std::mutex> lock(writer.mu);
+    MutexLock lock(writer.mu);
     previous = std::exchange(writer.logger, std::move(logger));
     if (previous) {
       previous->flush();
@@ -340,7 +341,7 @@ int TraceOpen(const std::string& path, std::size_t max_bytes, std::size_t max_fi
 
 void TraceClose() {
   Writer& writer = GetWriter();
-  std::lock_guard<std::mutex> lock(writer.mu);
+  MutexLock lock(writer.mu);
   if (writer.logger) {
     writer.logger->flush();
     writer.logger.reset();
@@ -349,7 +350,7 @@ void TraceClose() {
 
 void TraceFlush() {
   Writer& writer = GetWriter();
-  std::lock_guard<std::mutex> lock(writer.mu);
+  MutexLock lock(writer.mu);
   if (writer.logger) {
     writer.logger->flush();
   }
@@ -367,7 +368,7 @@ bool TraceEnabled(std::string_view unit, unsigned cls) {
 void TraceWrite(std::string_view unit, unsigned cls, std::string_view func, std::string_view text) {
   std::string body = FormatBody(unit, cls, func, text);
   Writer& writer = GetWriter();
-  std::lock_guard<std::mutex> lock(writer.mu);
+  MutexLock lock(writer.mu);
   if (!writer.logger) {
     writer.logger = MakeStderrLogger();
   }
@@ -446,7 +447,7 @@ TraceCapture::TraceCapture(std::string_view masks) : previous_masks_(TraceMasksT
   assert(rc == kOk && "TraceCapture needs valid trace masks");
   (void)rc;
   Writer& writer = GetWriter();
-  std::lock_guard<std::mutex> lock(writer.mu);
+  MutexLock lock(writer.mu);
   assert(!writer.capturing && "one TraceCapture at a time");
   writer.capturing = true;
   writer.captured.clear();
@@ -455,7 +456,7 @@ TraceCapture::TraceCapture(std::string_view masks) : previous_masks_(TraceMasksT
 TraceCapture::~TraceCapture() {
   {
     Writer& writer = GetWriter();
-    std::lock_guard<std::mutex> lock(writer.mu);
+    MutexLock lock(writer.mu);
     writer.capturing = false;
     writer.captured.clear();
   }
@@ -464,7 +465,7 @@ TraceCapture::~TraceCapture() {
 
 std::vector<std::string> TraceCapture::lines() const {
   Writer& writer = GetWriter();
-  std::lock_guard<std::mutex> lock(writer.mu);
+  MutexLock lock(writer.mu);
   return writer.captured;
 }
 
@@ -474,7 +475,7 @@ bool TraceCapture::contains(std::string_view text) const {
 
 int TraceCapture::count(std::string_view text) const {
   Writer& writer = GetWriter();
-  std::lock_guard<std::mutex> lock(writer.mu);
+  MutexLock lock(writer.mu);
   int n = 0;
   for (const std::string& line : writer.captured) {
     if (line.find(text) != std::string::npos) {
@@ -486,7 +487,7 @@ int TraceCapture::count(std::string_view text) const {
 
 void TraceCapture::clear() {
   Writer& writer = GetWriter();
-  std::lock_guard<std::mutex> lock(writer.mu);
+  MutexLock lock(writer.mu);
   writer.captured.clear();
 }
 

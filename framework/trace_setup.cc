@@ -4,17 +4,17 @@
 
 #include <cerrno>
 #include <cstring>
-#include <mutex>
 
 #include "framework/environment.h"
+#include "framework/mutex.h"
 #include "framework/status.h"
 #include "framework/trace.h"
 
 namespace fw {
 namespace {
 
-std::mutex g_mutex;
-std::string g_destination = "-";  // guarded by g_mutex
+constinit Mutex g_mutex;
+std::string g_destination GUARDED_BY(g_mutex) = "-";
 
 }  // namespace
 
@@ -48,13 +48,13 @@ int StartTracing(std::string* error) {
     *error = why + "; tracing to standard error";
     return kIoError;
   }
-  std::lock_guard<std::mutex> lock(g_mutex);
+  MutexLock lock(g_mutex);
   g_destination = path;
   return status;
 }
 
 std::string TraceDestination() {
-  std::lock_guard<std::mutex> lock(g_mutex);
+  MutexLock lock(g_mutex);
   return g_destination;
 }
 

@@ -6,13 +6,13 @@
 #include <cstdint>
 #include <limits>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <utility>
 #include <vector>
 
+#include "framework/mutex.h"
 #include "framework/trace.h"
 #include "q7tema/row_query.h"
 
@@ -26,8 +26,8 @@ constexpr int kSituationRequestType = 4;
 constexpr int kPatternErrorSeverity = 3;
 
 struct HookSlot {
-  std::mutex mutex;
-  PatternHooks hooks;  // guarded by mutex
+  fw::Mutex mutex;
+  PatternHooks hooks GUARDED_BY(mutex);
 };
 
 HookSlot& Slot() {
@@ -36,7 +36,7 @@ HookSlot& Slot() {
 }
 
 PatternHooks Hooks() {
-  std::lock_guard<std::mutex> lock(Slot().mutex);
+  fw::MutexLock lock(Slot().mutex);
   return Slot().hooks;
 }
 
@@ -153,7 +153,7 @@ void AddPatternRows(TableBase<Row>& agent) {
 }  // namespace
 
 void SetPatternHooks(PatternHooks hooks) {
-  std::lock_guard<std::mutex> lock(Slot().mutex);
+  fw::MutexLock lock(Slot().mutex);
   Slot().hooks = std::move(hooks);
 }
 

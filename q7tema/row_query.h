@@ -12,8 +12,9 @@
 // replaced may still be running on another thread until that call returns.
 
 #include <functional>
-#include <mutex>
 #include <utility>
+
+#include "framework/mutex.h"
 
 namespace q7tema {
 
@@ -24,8 +25,8 @@ namespace internal {
 
 template <typename Row>
 struct RowQuerySlot {
-  std::mutex mutex;
-  RowQuery<Row> query;  // guarded by mutex
+  fw::Mutex mutex;
+  RowQuery<Row> query GUARDED_BY(mutex);
 };
 
 // A function-local static, so a query may be set during static initialisation too.
@@ -41,7 +42,7 @@ RowQuerySlot<Row>& SlotFor() {
 template <typename Row>
 void SetRowQuery(RowQuery<Row> query) {
   internal::RowQuerySlot<Row>& slot = internal::SlotFor<Row>();
-  std::lock_guard<std::mutex> lock(slot.mutex);
+  fw::MutexLock lock(slot.mutex);
   slot.query = std::move(query);
 }
 
@@ -49,7 +50,7 @@ void SetRowQuery(RowQuery<Row> query) {
 template <typename Row>
 RowQuery<Row> RowQueryFor() {
   internal::RowQuerySlot<Row>& slot = internal::SlotFor<Row>();
-  std::lock_guard<std::mutex> lock(slot.mutex);
+  fw::MutexLock lock(slot.mutex);
   return slot.query;
 }
 

@@ -5,12 +5,12 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <mutex>
 #include <nlohmann/json.hpp>
 #include <string>
 
 #include "framework/agent_runtime.h"
 #include "framework/environment.h"
+#include "framework/mutex.h"
 #include "framework/trace.h"
 #include "q7tema/exported_tables.h"
 #include "q7tema/table_registry.h"
@@ -25,8 +25,8 @@ namespace {
 constexpr char kUnit[] = "tama";
 constexpr std::size_t kAgentNameChars = 24;
 
-std::mutex g_collector_state_mutex;
-std::string g_collector_state = "not supervised";  // guarded by g_collector_state_mutex
+constinit fw::Mutex g_collector_state_mutex;
+std::string g_collector_state GUARDED_BY(g_collector_state_mutex) = "not supervised";
 
 // Publishes identity and merged properties on /api/v1/agent. Runs on HTTP threads; the
 // globals and properties it reads are read-only once start-up is over.
@@ -56,7 +56,7 @@ void describeHealth(nlohmann::json& health) {
   } else {
     health["analyzer"] = "not built";
   }
-  std::lock_guard<std::mutex> lock(g_collector_state_mutex);
+  fw::MutexLock lock(g_collector_state_mutex);
   health["collector"] = g_collector_state;
 }
 
@@ -80,7 +80,7 @@ void nameAgent() {
 }
 
 void setCollectorState(const char* state) {
-  std::lock_guard<std::mutex> lock(g_collector_state_mutex);
+  fw::MutexLock lock(g_collector_state_mutex);
   g_collector_state = state;
 }
 

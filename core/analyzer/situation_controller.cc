@@ -164,10 +164,9 @@ long RecordCount(const std::string& image, size_t recordSize, const char* path) 
   return static_cast<long>((image.size() - kVersionSize) / recordSize);
 }
 
-// Reads the file when it changed since file.loaded: true with *image set when it did. Needs
-// file.mutex.
+// Reads the file when it changed since file.loaded: true with *image set when it did.
 template <typename File>
-bool ReadIfNewer(File& file, std::string* image) {
+bool ReadIfNewer(File& file, std::string* image) REQUIRES(file.mutex) {
   static constexpr const char* kWhere = "CSituationController::loadPatternsIfNewer";
   fw::UniqueFd fd(::open(file.path.c_str(), O_RDONLY | O_CLOEXEC));
   if (!fd.valid()) {
@@ -323,15 +322,16 @@ bool CSituationController::addClientPattern(std::unique_ptr<ClientPattern>&& pat
 
 template <typename Pattern>
 std::optional<Pattern> CSituationController::findOverlap(
-    const Pattern& candidate, const std::vector<Entry<Pattern>>& entries) const {
+    const Pattern& candidate, const std::vector<Entry<Pattern>> CSituationController::*entries)
+    const {
   using K = Kind<Pattern>;
   // Deciding an overlap can take milliseconds for long patterns; the search runs on copies so
   // that matching never waits for it.
   std::vector<Pattern> stored;
   {
     CvelMutexLock lock(mutex_);
-    stored.reserve(entries.size());
-    for (const Entry<Pattern>& e : entries) {
+    stored.reserve((this->*entries).size());
+    for (const Entry<Pattern>& e : this->*entries) {
       stored.push_back(*e.pattern);
     }
   }
@@ -348,12 +348,12 @@ std::optional<Pattern> CSituationController::findOverlap(
 
 std::optional<TransactionPattern> CSituationController::findOverlappingTransactionPattern(
     const TransactionPattern& candidate) const {
-  return findOverlap(candidate, transactions_);
+  return findOverlap(candidate, &CSituationController::transactions_);
 }
 
 std::optional<ClientPattern> CSituationController::findOverlappingClientPattern(
     const ClientPattern& candidate) const {
-  return findOverlap(candidate, clients_);
+  return findOverlap(candidate, &CSituationController::clients_);
 }
 
 template <typename Pattern>

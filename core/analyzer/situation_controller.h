@@ -182,9 +182,9 @@ class CSituationController {
   struct PatternFile {
     explicit PatternFile(std::string path) : path(std::move(path)) {}
     const std::string path;
-    CvelMutex mutex;  // serialises reading and writing the file; guards loaded
+    CvelMutex mutex;  // serialises reading and writing the file
     // Modification time of the file as last read or written here; zero before the first.
-    timespec loaded{};
+    timespec loaded GUARDED_BY(mutex){};
   };
 
   // The halves the two kinds of pattern share. entries is transactions_ or clients_ and file the
@@ -195,15 +195,16 @@ class CSituationController {
            std::vector<Entry<Pattern>>* entries);
   template <typename Pattern>
   int remove(const char* situationId, PatternFile& file, std::vector<Entry<Pattern>>* entries);
-  // Holds mutex_ only while it copies entries.
+  // Holds mutex_ only while it copies the entries (transactions_ or clients_).
   template <typename Pattern>
-  std::optional<Pattern> findOverlap(const Pattern& candidate,
-                                     const std::vector<Entry<Pattern>>& entries) const;
+  std::optional<Pattern> findOverlap(
+      const Pattern& candidate,
+      const std::vector<Entry<Pattern>> CSituationController::*entries) const EXCLUDES(mutex_);
   // Replaces entries with the file's patterns when it changed; true when it did.
   template <typename Pattern>
   bool reload(PatternFile& file, std::vector<Entry<Pattern>>* entries);
-  // Replaces file's contents with image and remembers its modification time. Needs file.mutex.
-  void write(PatternFile& file, const std::string& image);
+  // Replaces file's contents with image and remembers its modification time.
+  void write(PatternFile& file, const std::string& image) REQUIRES(file.mutex);
 
   const std::string directory_;
   PatternFile transactionFile_;
@@ -211,6 +212,6 @@ class CSituationController {
 
   // mutex_ guards the pattern arrays, their order and their counters.
   mutable CvelMutex mutex_;
-  std::vector<Entry<TransactionPattern>> transactions_;  // matching order; guarded by mutex_
-  std::vector<Entry<ClientPattern>> clients_;            // insertion order; guarded by mutex_
+  std::vector<Entry<TransactionPattern>> transactions_ GUARDED_BY(mutex_);  // matching order
+  std::vector<Entry<ClientPattern>> clients_ GUARDED_BY(mutex_);            // insertion order
 };

@@ -10,13 +10,13 @@
 #include <cstdio>
 #include <cstring>
 #include <deque>
-#include <mutex>
 #include <string_view>
 #include <utility>
 
 #include "framework/agent_runtime.h"
 #include "framework/clock.h"
 #include "framework/events.h"
+#include "framework/mutex.h"
 #include "framework/trace.h"
 
 namespace {
@@ -27,8 +27,8 @@ constexpr char kEventTable[] = "Q7AGNTMSGS";
 constexpr int kSampleRequestType = 3;
 
 struct Bundle {
-  std::mutex mutex;  // guards bundle
-  std::unique_ptr<icu::ResourceBundle> bundle;
+  fw::Mutex mutex;
+  std::unique_ptr<icu::ResourceBundle> bundle GUARDED_BY(mutex);
 };
 
 Bundle& TheBundle() {
@@ -37,8 +37,8 @@ Bundle& TheBundle() {
 }
 
 struct MessageList {
-  std::mutex mutex;                                    // guards messages
-  std::deque<std::unique_ptr<AgentMessage>> messages;  // oldest first
+  fw::Mutex mutex;
+  std::deque<std::unique_ptr<AgentMessage>> messages GUARDED_BY(mutex);  // oldest first
 };
 
 MessageList& TheList() {
@@ -84,7 +84,7 @@ std::string ToUtf8(const icu::UnicodeString& text) {
 // is open.
 bool LookUpPattern(const char* key, icu::UnicodeString* pattern) {
   Bundle& bundle = TheBundle();
-  std::lock_guard<std::mutex> lock(bundle.mutex);
+  fw::MutexLock lock(bundle.mutex);
   if (bundle.bundle == nullptr) {
     return false;
   }
@@ -112,7 +112,7 @@ void AgentMessage::setResourceBundle(const char* path) {
   UErrorCode status = U_ZERO_ERROR;
   auto bundle = std::make_unique<icu::ResourceBundle>(path, icu::Locale(name), status);
   Bundle& current = TheBundle();
-  std::lock_guard<std::mutex> lock(current.mutex);
+  fw::MutexLock lock(current.mutex);
   if (U_FAILURE(status)) {
     Q7_TRACE(kUnit, fw::kTraceError, "Could not open resource bundle %s", path);
     current.bundle.reset();
@@ -168,7 +168,7 @@ void AgentMessage::sendMessage(std::unique_ptr<AgentMessage> message) {
   const kq7_q7agntmsgs_data_t row = makeAgentMessageRow(*message, fw::Now());
   {
     MessageList& list = TheList();
-    std::lock_guard<std::mutex> lock(list.mutex);
+    fw::MutexLock lock(list.mutex);
     if (list.messages.size() >= kMaxMessages) {
       list.messages.pop_front();
     }
@@ -190,7 +190,7 @@ void AgentMessage::sendMessage(const char* key, int severity, const std::vector<
 
 std::vector<AgentMessage> AgentMessage::recentMessages() {
   MessageList& list = TheList();
-  std::lock_guard<std::mutex> lock(list.mutex);
+  fw::MutexLock lock(list.mutex);
   std::vector<AgentMessage> copies;
   copies.reserve(list.messages.size());
   for (const auto& message : list.messages) {
@@ -202,11 +202,11 @@ std::vector<AgentMessage> AgentMessage::recentMessages() {
 void AgentMessage::resetForTesting() {
   {
     Bundle& bundle = TheBundle();
-    std::lock_guard<std::mutex> lock(bundle.mutex);
+    fw::MutexLock lock(bundle.mutex);
     bundle.bundle.reset();
   }
   MessageList& list = TheList();
-  std::lock_guard<std::mutex> lock(list.mutex);
+  fw::MutexLock lock(list.mutex);
   list.messages.clear();
 }
 

@@ -130,9 +130,9 @@ void ExpectConsistent(AVLTree& tree, const std::multiset<int>& model,
 
 // A refused duplicate sees both hooks and survives although it asks to be deleted on removal.
 TEST(AvlTreeTest, RefusedDuplicateStaysAliveAfterBothHooks) {
-  AVLTree tree(0, false);
-  Hooks stored;
+  Hooks stored;  // outlives the tree, whose destructor deletes the stored row
   Hooks refused;
+  AVLTree tree(0, false);
   ASSERT_TRUE(tree.addNode(new Row(1, true, &stored)));
   Row duplicate(1, true, &refused);
   EXPECT_FALSE(tree.addNode(&duplicate));

@@ -19,6 +19,7 @@
 #include <pthread.h>
 
 #include "core/runtime/cvel_mutex.h"
+#include "framework/thread_annotations.h"
 
 enum TEventMode { kEventManualReset = 0, kEventAutoReset = 1 };
 
@@ -53,5 +54,5 @@ class CvelEvent {
   bool initialized_ = false;  // the condition exists; set once by the constructor
   pthread_cond_t condition_;
   CvelMutex mutex_;
-  bool signalled_;  // guarded by mutex_
+  bool signalled_ GUARDED_BY(mutex_);
 };

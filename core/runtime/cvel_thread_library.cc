@@ -6,12 +6,12 @@
 #include <atomic>
 #include <cerrno>
 #include <cstdio>
-#include <mutex>
 #include <type_traits>
 
 #include "core/runtime/cvel_error_stack.h"
 #include "core/runtime/cvel_status.h"
 #include "core/runtime/cvel_thread.h"
+#include "framework/mutex.h"
 #include "framework/trace.h"
 
 static_assert(std::is_same_v<pthread_t, unsigned long>,
@@ -20,9 +20,9 @@ static_assert(sizeof(pthread_key_t) <= sizeof(unsigned), "keys are handed out as
 
 namespace {
 
-// Serialises initialisation; a plain std::mutex so that it is usable during static
+// Serialises initialisation; constant-initialised, so that it is usable during static
 // initialisation (CLOG's mutex is constructed then).
-std::mutex g_init_mutex;
+constinit fw::Mutex g_init_mutex;
 // Set at the start of initialisation, as the library's own flag; guarded by g_init_mutex for
 // writes, read without it.
 std::atomic<bool> g_initialized{false};
@@ -38,8 +38,7 @@ long Fail(long code, const char* location) {
   return code;
 }
 
-// The caller holds g_init_mutex.
-long InitializeLocked() {
+long InitializeLocked() REQUIRES(g_init_mutex) {
   g_initialized.store(true);
   if (pthread_key_create(&g_name_key, nullptr) != 0) {
     return cvel::kKeyCreateFailed;
@@ -59,7 +58,7 @@ long InitializeLocked() {
 long CvelThreadLibrary::Initialize() {
   long rc;
   {
-    std::lock_guard<std::mutex> lock(g_init_mutex);
+    fw::MutexLock lock(g_init_mutex);
     rc = g_initialized.load() ? cvel::kLibraryAlreadyInitialized : InitializeLocked();
   }
   // Recorded outside the lock: recording needs the library.
@@ -77,7 +76,7 @@ long CvelThreadLibrary::EnsureInitialized() {
   if (g_ready.load(std::memory_order_acquire)) {
     return cvel::kOk;
   }
-  std::lock_guard<std::mutex> lock(g_init_mutex);
+  fw::MutexLock lock(g_init_mutex);
   if (g_initialized.load()) {
     return g_ready.load() ? cvel::kOk : cvel::kLibraryNotInitialized;
   }

@@ -16,6 +16,7 @@
 
 #include "core/runtime/avl_tree.h"
 #include "core/runtime/cvel_mutex.h"
+#include "framework/thread_annotations.h"
 
 class TSAVLTree : public AVLTree {
  public:
@@ -25,21 +26,23 @@ class TSAVLTree : public AVLTree {
   // Empties the tree under the lock. No other thread may start an operation once it runs.
   ~TSAVLTree() override;
 
-  bool addNode(TreeNode* n) override;
+  bool addNode(TreeNode* n) EXCLUDES(mutex) override;
   // Takes the mutex only when lock is true; false is for callers that already hold it.
   bool removeNode(TreeNode* key, bool lock) override;
-  bool removeNode(TreeNode* key) override;
-  TreeNode* findNode(TreeNode* key) override;
-  TreeNode* getLarger(TreeNode* key) override;
-  void dumpTree() override;
-  void dumpSortedTree() override;
-  void dumpATree(bool sorted, int* count, int* depth) override;
+  bool removeNode(TreeNode* key) EXCLUDES(mutex) override;
+  TreeNode* findNode(TreeNode* key) EXCLUDES(mutex) override;
+  TreeNode* getLarger(TreeNode* key) EXCLUDES(mutex) override;
+  void dumpTree() EXCLUDES(mutex) override;
+  void dumpSortedTree() EXCLUDES(mutex) override;
+  void dumpATree(bool sorted, int* count, int* depth) EXCLUDES(mutex) override;
 
-  TreeNode* markForDeletion(TreeNode* key);
-  TreeNode* AddRef(TreeNode* key);
-  TreeNode* Release(TreeNode* key);
-  int32_t getRefCount(TreeNode* key);
+  TreeNode* markForDeletion(TreeNode* key) EXCLUDES(mutex);
+  TreeNode* AddRef(TreeNode* key) EXCLUDES(mutex);
+  TreeNode* Release(TreeNode* key) EXCLUDES(mutex);
+  int32_t getRefCount(TreeNode* key) EXCLUDES(mutex);
 
  private:
-  CvelMutex mutex;  // guards the structure, the recency list, the counts and size
+  // Guards the structure, the recency list, the counts and size: AVLTree's fields, which no
+  // GUARDED_BY here can name.
+  CvelMutex mutex;
 };

@@ -27,6 +27,7 @@
 #include "core/runtime/cvel_event.h"
 #include "core/runtime/cvel_mutex.h"
 #include "core/runtime/cvel_status.h"
+#include "framework/thread_annotations.h"
 
 namespace tvel_internal {
 
@@ -111,7 +112,7 @@ class TvelQueue {
 
   // Rewinds the indices and wakes producers without touching the count. Only the destructor may
   // call it: the queue is inconsistent afterwards.
-  void Flush() {
+  void Flush() REQUIRES(v_queuemutex) {
     v_head = 0;
     v_tail = 0;
     v_notfull.Signal();
@@ -119,8 +120,7 @@ class TvelQueue {
   }
 
  private:
-  // Requires v_queuemutex.
-  long PutImpl(const T& item) {
+  long PutImpl(const T& item) REQUIRES(v_queuemutex) {
     tvel_internal::Check(v_numofitems.load() < v_currentmaxitem, "v_numofitems < v_currentmaxitem");
     v_tail = static_cast<long>((static_cast<unsigned long>(v_tail + 1)) % v_currentmaxitem);
     v_items[v_tail] = item;
@@ -133,8 +133,8 @@ class TvelQueue {
     return status;
   }
 
-  // Requires v_queuemutex and a non-empty queue.
-  void GetImpl(T& item) {
+  // Requires a non-empty queue.
+  void GetImpl(T& item) REQUIRES(v_queuemutex) {
     item = v_items[v_head];
     v_head = (v_head + 1) % v_currentmaxitem;
     const unsigned long count = v_numofitems.load() - 1;
@@ -147,12 +147,12 @@ class TvelQueue {
 
   // Items queued; written under v_queuemutex, read unlocked by IsFull/IsEmpty.
   std::atomic<unsigned long> v_numofitems{0};
-  std::unique_ptr<T[]> v_items;  // v_currentmaxitem slots; guarded by v_queuemutex
-  unsigned long v_head = 0;      // next slot to read; guarded by v_queuemutex
-  long v_tail = -1;              // last slot written; guarded by v_queuemutex
-  CvelEvent v_notempty{kEventManualReset, false};  // set while an item is queued
-  CvelEvent v_notfull{kEventManualReset, true};    // set while there is room
-  CvelMutex v_unusedmutex;                         // part of the queue's layout; nothing takes it
-  const unsigned long v_currentmaxitem;            // slots in v_items; 0 when allocation failed
-  CvelMutex v_queuemutex;  // guards the count's writes, the indices and the array
+  std::unique_ptr<T[]> v_items GUARDED_BY(v_queuemutex);  // v_currentmaxitem slots
+  unsigned long v_head GUARDED_BY(v_queuemutex) = 0;      // next slot to read
+  long v_tail GUARDED_BY(v_queuemutex) = -1;              // last slot written
+  CvelEvent v_notempty{kEventManualReset, false};         // set while an item is queued
+  CvelEvent v_notfull{kEventManualReset, true};           // set while there is room
+  CvelMutex v_unusedmutex;               // part of the queue's layout; nothing takes it
+  const unsigned long v_currentmaxitem;  // slots in v_items; 0 when allocation failed
+  CvelMutex v_queuemutex;                // also serialises the count's writes
 };

@@ -11,10 +11,11 @@
 #include <unistd.h>
 
 #include <chrono>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
+
+#include "framework/mutex.h"
 
 namespace q7ctl {
 namespace {
@@ -112,13 +113,13 @@ class FakeAgent {
     std::vector<std::string> wheres;
   };
   Seen last() {
-    std::lock_guard<std::mutex> lock(mutex_);
+    fw::MutexLock lock(mutex_);
     return last_;
   }
 
  private:
   void Record(const httplib::Request& req) {
-    std::lock_guard<std::mutex> lock(mutex_);
+    fw::MutexLock lock(mutex_);
     last_ = Seen{req.get_header_value("Authorization"), req.body, {}};
     for (std::size_t i = 0; i < req.get_param_value_count("where"); ++i) {
       last_.wheres.push_back(req.get_param_value("where", i));
@@ -128,8 +129,8 @@ class FakeAgent {
   httplib::Server server_;
   int port_ = 0;
   std::thread thread_;
-  std::mutex mutex_;
-  Seen last_;  // guarded by mutex_
+  fw::Mutex mutex_;
+  Seen last_ GUARDED_BY(mutex_);
 };
 
 // The token goes out as a Bearer header and the PUT body is the situation as given.

@@ -9,8 +9,9 @@
 
 #include <atomic>
 #include <cstdint>
-#include <mutex>
 #include <string>
+
+#include "framework/mutex.h"
 
 class IntakeCounters {
  public:
@@ -26,7 +27,7 @@ class IntakeCounters {
   void recordUnparsed() { recordsUnparsed_.fetch_add(1, std::memory_order_relaxed); }
   void outlierDropped() { outliersDropped_.fetch_add(1, std::memory_order_relaxed); }
   void reading(const std::string& file, long long offset) {
-    std::lock_guard<std::mutex> lock(mutex_);
+    fw::MutexLock lock(mutex_);
     file_ = file;
     offset_ = offset;
   }
@@ -36,7 +37,7 @@ class IntakeCounters {
     s.recordsRead = recordsRead_.load(std::memory_order_relaxed);
     s.recordsUnparsed = recordsUnparsed_.load(std::memory_order_relaxed);
     s.outliersDropped = outliersDropped_.load(std::memory_order_relaxed);
-    std::lock_guard<std::mutex> lock(mutex_);
+    fw::MutexLock lock(mutex_);
     s.file = file_;
     s.offset = offset_;
     return s;
@@ -46,7 +47,7 @@ class IntakeCounters {
   std::atomic<int64_t> recordsRead_{0};
   std::atomic<int64_t> recordsUnparsed_{0};
   std::atomic<int64_t> outliersDropped_{0};
-  mutable std::mutex mutex_;
-  std::string file_;      // guarded by mutex_
-  long long offset_ = 0;  // guarded by mutex_
+  mutable fw::Mutex mutex_;
+  std::string file_ GUARDED_BY(mutex_);
+  long long offset_ GUARDED_BY(mutex_) = 0;
 };
