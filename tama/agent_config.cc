@@ -7,6 +7,7 @@
 #include <string>
 
 #include "core/config/cconfig.h"
+#include "core/messages/agent_message.h"
 #include "framework/config_file.h"
 #include "framework/environment.h"
 #include "framework/status.h"
@@ -18,8 +19,6 @@ namespace {
 
 constexpr const char* kUnit = "tama";
 constexpr const char* kOutlierProperty = "KQ7EXCLUDEOUTLIERSECONDS";
-
-BundleHook g_bundle_hook = nullptr;
 
 // Bounded concatenation into a path buffer; longer text is cut at the buffer size.
 void Compose(char (&dest)[kPathBufferSize], const std::string& a, const std::string& b = {},
@@ -68,10 +67,6 @@ void MergeConfigFile(const char* path) {
 
 }  // namespace
 
-void setResourceBundleHook(BundleHook hook) {
-  g_bundle_hook = hook;
-}
-
 void readAgentConfig() {
   Q7_FLOW(kUnit);
   std::string base_dir;
@@ -113,9 +108,7 @@ void readAgentConfig() {
     AgentProperties::setAgentProperty("AgentLibDir", KQ1_CLASSPATH);
     Compose(RT_BundlePath, KQ1_CLASSPATH, "/", "RTAgentMsgs");
     Q7_TRACE(kUnit, fw::kTraceDetail, "RT_BundlePath = %s", RT_BundlePath);
-    if (g_bundle_hook != nullptr) {
-      g_bundle_hook(RT_BundlePath);
-    }
+    AgentMessage::setResourceBundle(RT_BundlePath);
   }
 
   MergeConfigFile(KQ1_ConfigPath);

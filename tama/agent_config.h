@@ -6,16 +6,12 @@
 //
 // Thread safety: main thread only, during start-up and before any worker thread starts.
 
-// Receives the message bundle path (RT_BundlePath) when KQ7_CLASSPATH is known. The agent
-// messages code installs it; until then no bundle is handed over.
-using BundleHook = void (*)(const char* path);
-void setResourceBundleHook(BundleHook hook);
-
 // Builds KTX_MordelDir, KQ1_BaseDir, KQ1_ConfigPath, KQ1_DetailsPath (and KQ1_CLASSPATH and
-// RT_BundlePath when KQ7_CLASSPATH is set), loads the properties file, sets the fixed
-// properties (AgentBaseDir, AgentConfigDir, AgentType, AgentVersion, AgentLibDir), then lets
-// the unnamed instance of the configuration file override them entry by entry. Failures leave
-// empty values or the properties gathered so far, with a trace; nothing stops the agent.
+// RT_BundlePath when KQ7_CLASSPATH is set; the agent messages then open that bundle), loads the
+// properties file, sets the fixed properties (AgentBaseDir, AgentConfigDir, AgentType,
+// AgentVersion, AgentLibDir), then lets the unnamed instance of the configuration file override
+// them entry by entry. Failures leave empty values or the properties gathered so far, with a trace;
+// nothing stops the agent.
 void readAgentConfig();
 
 // Sets the outlier limit from the property KQ7EXCLUDEOUTLIERSECONDS: whole seconds when it

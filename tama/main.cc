@@ -9,7 +9,6 @@
 #include "framework/trace.h"
 #include "framework/trace_setup.h"
 #include "tama/ct_main.h"
-#include "tama/install_hooks.h"
 
 namespace {
 
@@ -77,7 +76,6 @@ int main(int argc, char** argv) {
     std::fprintf(stderr, "q7agent: %s\n", error.c_str());
   }
   Q7_FLOW(kUnit);
-  tama::installAgentHooks();
   const int result = CtMain(argc, argv);
   Q7_TRACE(kUnit, fw::kTraceSummary, "CtMain returned %d", result);
   fw::TraceFlush();

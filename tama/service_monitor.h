@@ -19,7 +19,7 @@
 #include <memory>
 
 #include "core/runtime/cvel_event.h"
-#include "tama/agent_hooks.h"
+#include "tama/collector_monitor.h"
 
 class ServiceMonitor {
  public:

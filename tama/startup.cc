@@ -5,60 +5,22 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <nlohmann/json.hpp>
 #include <string>
 
+#include "core/config/cconfig.h"
 #include "framework/agent_runtime.h"
 #include "framework/environment.h"
-#include "framework/mutex.h"
 #include "framework/trace.h"
 #include "q7tema/exported_tables.h"
 #include "q7tema/table_registry.h"
 #include "tama/agent_config.h"
 #include "tama/agent_globals.h"
-#include "tama/agent_hooks.h"
 #include "tama/agent_properties.h"
-#include "core/config/cconfig.h"
 
 namespace {
 
 constexpr char kUnit[] = "tama";
 constexpr std::size_t kAgentNameChars = 24;
-
-constinit fw::Mutex g_collector_state_mutex;
-std::string g_collector_state GUARDED_BY(g_collector_state_mutex) = "not supervised";
-
-// Publishes identity and merged properties on /api/v1/agent. Runs on HTTP threads; the
-// globals and properties it reads are read-only once start-up is over.
-void describeAgent(nlohmann::json& info) {
-  info["agent_name"] = kq1_agent_name;
-  info["short_agent_name"] = kq1_short_agent_name;
-  info["system_name"] = kq1_system_name;
-  info["product_version"] = kq1_product_ver;
-  nlohmann::json properties = nlohmann::json::object();
-  for (const std::string& name : AgentProperties::getPropertyNames()) {
-    properties[name] = AgentProperties::getAgentProperty(name);
-  }
-  info["properties"] = std::move(properties);
-  if (tama::agentHooks().describe_analyzer) {
-    nlohmann::json analyzer;
-    tama::agentHooks().describe_analyzer(analyzer);
-    info["analyzer"] = analyzer["state"];
-    info["counters"] = analyzer["counters"];
-  }
-}
-
-void describeHealth(nlohmann::json& health) {
-  if (tama::agentHooks().describe_analyzer) {
-    nlohmann::json analyzer;
-    tama::agentHooks().describe_analyzer(analyzer);
-    health["analyzer"] = analyzer["state"];
-  } else {
-    health["analyzer"] = "not built";
-  }
-  fw::MutexLock lock(g_collector_state_mutex);
-  health["collector"] = g_collector_state;
-}
 
 }  // namespace
 
@@ -79,11 +41,6 @@ void nameAgent() {
   fw::SetHostName(kq1_short_agent_name);
 }
 
-void setCollectorState(const char* state) {
-  fw::MutexLock lock(g_collector_state_mutex);
-  g_collector_state = state;
-}
-
 }  // namespace tama
 
 void prepareMsgFileName() {
@@ -97,25 +54,7 @@ void prepareMsgFileName() {
   Q7_TRACE(kUnit, fw::kTraceDetail, "KQ1_MsgFileName<%s>", KQ1_MsgFileName);
 }
 
-void prepare_startup(int /*argc*/, char** /*argv*/) {
-  Q7_FLOW(kUnit);
-  std::memcpy(kq1_product_code, "Q7", 3);
-
-  fw::RegisterAgentLoader(LoadAgents);
-  fw::RegisterCommandCallback("KQ7", HandleTakeAction);
-
-  std::memset(kq1_product_ver, 0, sizeof(kq1_product_ver));
-  fw::SetVersionFromProductCode(kq1_product_code, kq1_product_ver, sizeof(kq1_product_ver));
-  fw::SetNodeTypeFromProductCode(kq1_product_code);
-
-  tama::nameAgent();
-  std::memset(kq1_system_name, ' ', sizeof(kq1_system_name));
-  DetermineLocalHost(kq1_system_name, sizeof(kq1_system_name));
-  Q7_TRACE(kUnit, fw::kTraceDetail, "kq1_agent_name<%s> kq1_system_name<%s> justhostname<%s> ",
-           kq1_agent_name, kq1_system_name, kq1_short_agent_name);
-
-  readAgentConfig();
-
+void applyAgentProperties() {
   CConfig::setBaseDirectory(AgentProperties::getAgentProperty("AgentBaseDir").c_str());
   const std::string dpx_path = AgentProperties::getAgentProperty("KQ7DPXLOGPATH");
   CConfig::setDpxDataDirectory(dpx_path.c_str());
@@ -132,30 +71,6 @@ void prepare_startup(int /*argc*/, char** /*argv*/) {
       std::strtol(AgentProperties::getAgentProperty("KQ7OVERTIMEINTERVAL").c_str(), nullptr, 10)));
   CConfig::setSummaryInterval(static_cast<int>(
       std::strtol(AgentProperties::getAgentProperty("KQ7SUMMARYINTERVAL").c_str(), nullptr, 10)));
-
-  doExcludeOutliers();
-
-  fw::SetAgentInfoProvider(describeAgent);
-  fw::SetHealthProvider(describeHealth);
-
-  if (tama::agentHooks().start_analyzer) {
-    tama::agentHooks().start_analyzer();
-  } else {
-    Q7_TRACE(kUnit, fw::kTraceSummary, "the analyzer is not part of this build");
-  }
-}
-
-void prepare_shutdown() {
-  Q7_FLOW(kUnit);
-  const tama::AgentHooks& hooks = tama::agentHooks();
-  if (hooks.shutdown_analyzer) {
-    hooks.shutdown_analyzer();
-  }
-  Q7_TRACE(kUnit, fw::kTraceDetail, "Waiting for Analyzer to shutdown.");
-  if (hooks.join_analyzer) {
-    hooks.join_analyzer();
-  }
-  Q7_TRACE(kUnit, fw::kTraceDetail, "Analyzer Completed Shutdown.");
 }
 
 int LoadAgents() {

@@ -1,5 +1,5 @@
 // Start-up and shutdown of the agent: naming, the message file name, the loader and command
-// callbacks, and CtMain's ordering of collector supervision around the main loop.
+// callbacks, and the Agent's ordering of collector supervision around the main loop.
 
 #include "tama/startup.h"
 
@@ -10,6 +10,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
+#include <nlohmann/json.hpp>
 #include <string>
 #include <vector>
 
@@ -17,9 +18,8 @@
 #include "framework/tables.h"
 #include "framework/trace_capture.h"
 #include "q7tema/table_registry.h"
+#include "tama/agent.h"
 #include "tama/agent_globals.h"
-#include "tama/agent_hooks.h"
-#include "tama/ct_main.h"
 #include "tama/signal_manager.h"
 #include "tests/support/scratch_dir.h"
 
@@ -42,7 +42,6 @@ class StartupTest : public ::testing::Test {
     setenv("Q7_HTTP_ADDRESS", "127.0.0.1:0", 1);
   }
   void TearDown() override {
-    tama::agentHooks() = tama::AgentHooks{};
     fw::ResetRuntimeForTesting();
     unsetenv("Q7_HOME");
     unsetenv("Q7_HTTP_ADDRESS");
@@ -121,33 +120,37 @@ class FakeMonitor : public tama::CollectorMonitor {
   std::string which_;
 };
 
-void installFakeHooks() {
+// An agent whose parts record what they are asked to do and whose start message ends the main
+// loop at once.
+tama::AgentParts FakeParts() {
   g_events.clear();
-  tama::AgentHooks& hooks = tama::agentHooks();
-  hooks.make_collector_monitor = [](const tama::CollectorMonitorSpec& monitor) {
+  tama::AgentParts parts;
+  parts.make_collector_monitor = [](const tama::CollectorMonitorSpec& monitor) {
     const std::string which = monitor.start_argv.back();
     g_events.push_back("create " + which + " " +
                        std::filesystem::path(monitor.pid_file).filename().string());
     return std::unique_ptr<tama::CollectorMonitor>(new FakeMonitor(which));
   };
-  hooks.start_analyzer = [] { g_events.push_back("analyzer start"); };
-  hooks.shutdown_analyzer = [] { g_events.push_back("analyzer shutdown"); };
-  hooks.join_analyzer = [] { g_events.push_back("analyzer join"); };
-  hooks.send_agent_message = [](const char* key, int severity, const std::vector<std::string>&) {
+  parts.start_analyzer = [] { g_events.push_back("analyzer start"); };
+  parts.shutdown_analyzer = [] { g_events.push_back("analyzer shutdown"); };
+  parts.join_analyzer = [] { g_events.push_back("analyzer join"); };
+  parts.describe_analyzer = [](nlohmann::json& out) { out["state"] = "running"; };
+  parts.send_agent_message = [](const char* key, int severity, const std::vector<std::string>&) {
     g_events.push_back(std::string("message ") + key + " " + std::to_string(severity));
     fw::RequestShutdown(1);  // leave the main loop at once
   };
+  return parts;
 }
 
 // The writer process is started before the capture process and stopped before it too; the
 // analyzer shuts down after both.
 TEST_F(StartupTest, CtMainOrdersSupervisionAroundMainLoop) {
   fakeNodeName("hostA.part2");
-  installFakeHooks();
   unsetenv("DPX_NOSTART");
   char arg0[] = "q7agent";
   char* argv[] = {arg0, nullptr};
-  EXPECT_EQ(0, CtMain(1, argv));
+  tama::Agent agent(FakeParts());
+  EXPECT_EQ(0, agent.run(1, argv));
   const std::vector<std::string> expected{"analyzer start",
                                           "create analyzer zolt414_hostA.part2.pid",
                                           "create collector zelt_hostA.part2.pid",
@@ -163,11 +166,11 @@ TEST_F(StartupTest, CtMainOrdersSupervisionAroundMainLoop) {
 
 // DPX_NOSTART, even empty, means no monitor is created, started or stopped.
 TEST_F(StartupTest, NoStartSuppressesSupervision) {
-  installFakeHooks();
   setenv("DPX_NOSTART", "", 1);
   char arg0[] = "q7agent";
   char* argv[] = {arg0, nullptr};
-  EXPECT_EQ(0, CtMain(1, argv));
+  tama::Agent agent(FakeParts());
+  EXPECT_EQ(0, agent.run(1, argv));
   const std::vector<std::string> expected{"analyzer start", "message RT_AGENT_STARTED 4",
                                           "analyzer shutdown", "analyzer join"};
   EXPECT_EQ(expected, g_events);
@@ -177,7 +180,7 @@ TEST_F(StartupTest, NoStartSuppressesSupervision) {
 TEST_F(StartupTest, SignalManagerTurnsSigtermIntoShutdown) {
   fw::TraceCapture capture;
   SignalManager manager;
-  // Aimed at this manager: an earlier CtMain in the same process left its own one waiting.
+  // Aimed at this manager: an earlier agent run in the same process left its own one waiting.
   ASSERT_EQ(0, pthread_kill(manager.managerThreadForTesting(), SIGTERM));
   manager.joinManagerThreadForTesting();
   EXPECT_TRUE(fw::ShutdownRequested());

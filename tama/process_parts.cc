@@ -1,32 +1,31 @@
-#include "tama/install_hooks.h"
-
 #include <nlohmann/json.hpp>
 
 #include "core/analyzer/dpx_analyzer.h"
 #include "core/messages/agent_message.h"
 #include "q7tema/pattern_tables.h"
 #include "q7tema/row_query.h"
-#include "tama/agent_config.h"
+#include "tama/agent.h"
 #include "tama/agent_details.h"
-#include "tama/agent_hooks.h"
 #include "tama/service_monitor.h"
+
+// The parts of the q7agent process, and the binding of the tables to the analyzer.
 
 namespace tama {
 
 namespace {
 
 // The exported row tables the analyzer answers.
-#define Q7_ANALYZER_ROW_TABLES(X)                                                             \
-  X(appot)                                                                                    \
-  X(appsm)                                                                                    \
-  X(clntapp)                                                                                  \
-  X(clntot)                                                                                   \
-  X(clntsm)                                                                                   \
-  X(clntsrv)                                                                                  \
-  X(srvappsm)                                                                                 \
-  X(srvot)                                                                                    \
-  X(srvsm) X(txins) X(txot) X(txsm) X(txcs) X(appcs) X(clntcs) X(srvcs) X(subtxsm) X(subtxot) \
-      X(subtxins)
+#define Q7_ANALYZER_ROW_TABLES(X) \
+  X(appot)                        \
+  X(appsm)                        \
+  X(clntapp)                      \
+  X(clntot)                       \
+  X(clntsm)                       \
+  X(clntsrv)                      \
+  X(srvappsm)                     \
+  X(srvot)                        \
+  X(srvsm)                        \
+  X(txins) X(txot) X(txsm) X(txcs) X(appcs) X(clntcs) X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
 
 void installRowQueries() {
 #define Q7_ROW_QUERY(name)                                                       \
@@ -101,21 +100,20 @@ void describeAnalyzer(nlohmann::json& out) {
 
 }  // namespace
 
-void installAgentHooks() {
-  AgentHooks& hooks = agentHooks();
-  hooks.start_analyzer = [] { CDPXAnalyzer::GetInstance(); };
-  hooks.shutdown_analyzer = [] { CDPXAnalyzer::GetInstanceNoStart()->Shutdown(); };
-  hooks.join_analyzer = [] { CDPXAnalyzer::GetInstanceNoStart()->Join(); };
-  hooks.describe_analyzer = &describeAnalyzer;
-  hooks.make_collector_monitor = &makeServiceMonitor;
-  hooks.send_agent_message = [](const char* key, int severity,
+AgentParts ProcessParts() {
+  installRowQueries();
+  installPatternHooks();
+  AgentParts parts;
+  parts.start_analyzer = [] { CDPXAnalyzer::GetInstance(); };
+  parts.shutdown_analyzer = [] { CDPXAnalyzer::GetInstanceNoStart()->Shutdown(); };
+  parts.join_analyzer = [] { CDPXAnalyzer::GetInstanceNoStart()->Join(); };
+  parts.describe_analyzer = &describeAnalyzer;
+  parts.make_collector_monitor = &makeServiceMonitor;
+  parts.send_agent_message = [](const char* key, int severity,
                                 const std::vector<std::string>& args) {
     AgentMessage::sendMessage(key, severity, args);
   };
-  // Messages are looked up in the bundle that configuration finds beside the agent.
-  setResourceBundleHook(&AgentMessage::setResourceBundle);
-  installRowQueries();
-  installPatternHooks();
+  return parts;
 }
 
 }  // namespace tama

@@ -1,0 +1,173 @@
+#include "tama/agent.h"
+
+#include <cstdlib>
+#include <nlohmann/json.hpp>
+#include <string>
+#include <utility>
+
+#include "core/config/cconfig.h"
+#include "framework/agent_runtime.h"
+#include "framework/trace.h"
+#include "tama/agent_config.h"
+#include "tama/agent_globals.h"
+#include "tama/agent_properties.h"
+#include "tama/signal_manager.h"
+#include "tama/startup.h"
+
+namespace tama {
+
+namespace {
+
+constexpr char kUnit[] = "tama";
+
+// Deliberately never destroyed: by the time the process ends its thread has finished. One per
+// process: only tests run an agent twice.
+SignalManager* g_signalManager = nullptr;
+
+// Stops one collector monitor: waits for its thread, which stops the process when alive.
+void stopMonitor(std::unique_ptr<CollectorMonitor>& monitor, const char* done) {
+  if (monitor) {
+    monitor->stop();
+    Q7_TRACE(kUnit, fw::kTraceDetail, "%s", done);
+    monitor.reset();
+  }
+}
+
+}  // namespace
+
+Agent::Agent(AgentParts parts) : parts_(std::move(parts)) {}
+
+Agent::~Agent() {
+  // The providers capture this agent; none may outlive it.
+  fw::SetAgentInfoProvider({});
+  fw::SetHealthProvider({});
+}
+
+int Agent::run(int argc, char** argv) {
+  Q7_FLOW(kUnit);
+  const bool noStart = std::getenv("DPX_NOSTART") != nullptr;
+  if (noStart) {
+    Q7_TRACE(kUnit, fw::kTraceError,
+             "DPX_NOSTART environment variable found. Will not start DPX processes.");
+  }
+  if (std::getenv("DPX_ZERORECORDS") != nullptr) {
+    CConfig::setReportZeroRecords(true);
+    Q7_TRACE(kUnit, fw::kTraceError,
+             "DPX_ZERORECORDS environment variable found. Will report 0 records for some tables.");
+  }
+
+  // Before any other thread, so that all of them inherit the blocked SIGINT and SIGTERM.
+  if (g_signalManager == nullptr) {
+    g_signalManager = new SignalManager();
+  }
+
+  prepareMsgFileName();
+  prepare_startup(argc, argv);
+
+  const std::string collectorDir = std::string(KQ1_BaseDir) + "/" + "dpx" + "/";
+  const std::string script = collectorDir + "sm3ctl";
+  const std::string platformDir = collectorDir + "linux" + "/";
+  CollectorMonitorSpec analyzerSpec;
+  analyzerSpec.pid_file = platformDir + "zolt414_" + kq1_agent_name + ".pid";
+  analyzerSpec.start_argv = {"/bin/sh", script, "start", "analyzer"};
+  analyzerSpec.stop_argv = {"/bin/sh", script, "stop", "analyzer"};
+  analyzerSpec.env = {"PATH=/bin:/sbin:/usr/bin:/usr/sbin"};
+  analyzerSpec.poll_seconds = 60;
+  CollectorMonitorSpec collectorSpec = analyzerSpec;
+  collectorSpec.pid_file = platformDir + "zelt_" + kq1_agent_name + ".pid";
+  collectorSpec.start_argv = {"/bin/sh", script, "start", "collector"};
+  collectorSpec.stop_argv = {"/bin/sh", script, "stop", "collector"};
+
+  std::unique_ptr<CollectorMonitor> analyzerMonitor;
+  std::unique_ptr<CollectorMonitor> collectorMonitor;
+  if (noStart) {
+    setCollectorState("not supervised (DPX_NOSTART)");
+  } else {
+    // The writer ("analyzer") process must run before the capture ("collector") process.
+    analyzerMonitor = parts_.make_collector_monitor(analyzerSpec);
+    collectorMonitor = parts_.make_collector_monitor(collectorSpec);
+    analyzerMonitor->start();
+    Q7_TRACE(kUnit, fw::kTraceDetail, "Started unix DPX Analyzer monitor");
+    collectorMonitor->start();
+    Q7_TRACE(kUnit, fw::kTraceDetail, "Started unix DPX Collector monitor");
+    setCollectorState("supervised");
+  }
+
+  parts_.send_agent_message("RT_AGENT_STARTED", 4, {});
+
+  const int result = kunmain(argc, argv);
+
+  stopMonitor(analyzerMonitor, "Stopped DPX Analyzer monitor");
+  stopMonitor(collectorMonitor, "Stopped DPX Collector monitor");
+
+  prepare_shutdown();
+  return result;
+}
+
+void Agent::prepare_startup(int /*argc*/, char** /*argv*/) {
+  Q7_FLOW(kUnit);
+  std::memcpy(kq1_product_code, "Q7", 3);
+
+  fw::RegisterAgentLoader(LoadAgents);
+  fw::RegisterCommandCallback("KQ7", HandleTakeAction);
+
+  std::memset(kq1_product_ver, 0, sizeof(kq1_product_ver));
+  fw::SetVersionFromProductCode(kq1_product_code, kq1_product_ver, sizeof(kq1_product_ver));
+  fw::SetNodeTypeFromProductCode(kq1_product_code);
+
+  nameAgent();
+  std::memset(kq1_system_name, ' ', sizeof(kq1_system_name));
+  DetermineLocalHost(kq1_system_name, sizeof(kq1_system_name));
+  Q7_TRACE(kUnit, fw::kTraceDetail, "kq1_agent_name<%s> kq1_system_name<%s> justhostname<%s> ",
+           kq1_agent_name, kq1_system_name, kq1_short_agent_name);
+
+  readAgentConfig();
+  applyAgentProperties();
+  doExcludeOutliers();
+
+  fw::SetAgentInfoProvider([this](nlohmann::json& info) { describeAgent(info); });
+  fw::SetHealthProvider([this](nlohmann::json& health) { describeHealth(health); });
+
+  parts_.start_analyzer();
+}
+
+void Agent::prepare_shutdown() {
+  Q7_FLOW(kUnit);
+  parts_.shutdown_analyzer();
+  Q7_TRACE(kUnit, fw::kTraceDetail, "Waiting for Analyzer to shutdown.");
+  parts_.join_analyzer();
+  Q7_TRACE(kUnit, fw::kTraceDetail, "Analyzer Completed Shutdown.");
+}
+
+// Publishes identity, merged properties and the analyzer's counters on /api/v1/agent. The
+// globals and properties it reads are read-only once start-up is over.
+void Agent::describeAgent(nlohmann::json& info) const {
+  info["agent_name"] = kq1_agent_name;
+  info["short_agent_name"] = kq1_short_agent_name;
+  info["system_name"] = kq1_system_name;
+  info["product_version"] = kq1_product_ver;
+  nlohmann::json properties = nlohmann::json::object();
+  for (const std::string& name : AgentProperties::getPropertyNames()) {
+    properties[name] = AgentProperties::getAgentProperty(name);
+  }
+  info["properties"] = std::move(properties);
+  nlohmann::json analyzer;
+  parts_.describe_analyzer(analyzer);
+  info["analyzer"] = analyzer["state"];
+  info["counters"] = analyzer["counters"];
+}
+
+void Agent::describeHealth(nlohmann::json& health) const {
+  nlohmann::json analyzer;
+  parts_.describe_analyzer(analyzer);
+  health["analyzer"] = analyzer["state"];
+  fw::MutexLock lock(mutex_);
+  health["collector"] = collectorState_;
+}
+
+void Agent::setCollectorState(const char* state) {
+  fw::MutexLock lock(mutex_);
+  collectorState_ = state;
+}
+
+}  // namespace tama
