@@ -227,11 +227,12 @@ TEST_F(AgentE2ETest, BadConfigurationIsTracedNotFatal) {
 // Transactions read from the collector's data directory reach the summary, current-status and
 // instance tables with the counts of sm3gen's truth; a filter and CSV work on them.
 TEST_F(AgentE2ETest, FedTransactionsReachTheTables) {
+  const std::string data = useDataDirectory() + "/feed.sm3";
+  registerCatchAllPattern();
   // Keep the whole test inside one 5-minute interval, so current-status rows hold everything.
   while (time(nullptr) % 300 > 280) {
     std::this_thread::sleep_for(1s);
   }
-  const std::string data = useDataDirectory() + "/feed.sm3";
   const std::string truthPath = home_.path() + "truth.json";
   const std::string command = std::string(SM3GEN_PATH) + " --out " + data + " --truth " +
                               truthPath + " --records 400 --sites 2 --seed 3 --rate 1000 --start " +
@@ -243,7 +244,6 @@ TEST_F(AgentE2ETest, FedTransactionsReachTheTables) {
     pages += figures["pages"]["count"].get<long>();
   }
   ASSERT_GT(pages, 10);
-  registerCatchAllPattern();
   const std::string address = start();
 
   const auto total = &AgentE2ETest::totalRequests;

@@ -19,7 +19,6 @@
 #include <string>
 #include <vector>
 
-#include "core/analyzer/situation_controller.h"
 #include "tests/agent_process.h"
 
 namespace q7test {
@@ -55,23 +54,54 @@ class AgentE2ETest : public ::testing::Test {
     return data;
   }
 
-  // Registers, before start, one catch-all transaction pattern that keeps every application and
-  // transaction name and collects every instance.
+  // Starts one catch-all situation on the transaction pattern table, as an operator does: over
+  // the API, on an agent started for the purpose and stopped again, so that the situation (kept
+  // across restarts) is in place before the test's own start. It keeps every application and
+  // transaction name and collects every instance. The agent reads the data directory meanwhile:
+  // call this before the test writes data.
   void registerCatchAllPattern() {
-    CSituationController controller(base() + "odi/dpx");
-    auto pattern = std::make_unique<TransactionPattern>();
-    setPatternText(pattern->applicationName, "All");
-    setPatternText(pattern->applicationPattern, "*");
-    setPatternText(pattern->transactionName, "All");
-    setPatternText(pattern->transactionPattern, "*");
-    setPatternText(pattern->situationId, "everything");
-    pattern->aggappsuniq = 1;
-    pattern->aggtxsuniq = 1;
-    pattern->collectInstances = 1;
-    pattern->mrtthres = 10000000;
-    ASSERT_TRUE(controller.addTransactionPattern(std::move(pattern)));
+    const bool supervise = superviseCollector_;
+    superviseCollector_ = false;
+    const std::string address = start();
+    const std::string body = R"({"table": "Q7TXPTNS", "conditions": [
+        {"column": "APPLICATIN", "value": "All"}, {"column": "APPPATTERN", "value": "*"},
+        {"column": "TRANSACTN", "value": "All"}, {"column": "TRANSPATTN", "value": "*"},
+        {"column": "AGGAPSUNIQ", "value": "1"}, {"column": "AGGTXSUNIQ", "value": "1"},
+        {"column": "COLLINSTCS", "value": "1"}, {"column": "MRTTHRES", "value": "10000000"}]})";
+    std::string reply;
+    const int status = send(address, "PUT", "/api/v1/situations/everything", body, token(), &reply);
+    EXPECT_TRUE(status == 200 || status == 201) << status << " " << reply;
+    stopWith(SIGTERM);
+    superviseCollector_ = supervise;
   }
 
+  // The bearer token the agent created at its first start.
+  std::string token() const {
+    std::string t = readFile(home_.path() + "config/q7_api_token");
+    while (!t.empty() && (t.back() == '\n' || t.back() == ' ')) {
+      t.pop_back();
+    }
+    return t;
+  }
+  // A request with an optional bearer token; its status and body.
+  int send(const std::string& address, const std::string& method, const std::string& path,
+           const std::string& body, const std::string& bearer, std::string* reply = nullptr) {
+    httplib::Client client("http://" + address);
+    client.set_connection_timeout(2);
+    httplib::Headers headers;
+    if (!bearer.empty()) {
+      headers.emplace("Authorization", "Bearer " + bearer);
+    }
+    const auto res = method == "PUT" ? client.Put(path.c_str(), headers, body, "application/json")
+                                     : client.Delete(path.c_str(), headers);
+    if (!res) {
+      return -1;
+    }
+    if (reply != nullptr) {
+      *reply = res->body;
+    }
+    return res->status;
+  }
   // The sum of totreq over a sample's rows.
   static long totalRequests(const nlohmann::json& body) {
     long sum = 0;

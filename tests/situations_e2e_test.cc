@@ -36,32 +36,6 @@ class SituationsE2ETest : public AgentE2ETest {
     EXPECT_EQ(0, ctl(all, &out)) << out;
     return nlohmann::json::parse(out, nullptr, false);
   }
-  std::string token() const {
-    std::string t = readFile(home_.path() + "config/q7_api_token");
-    while (!t.empty() && (t.back() == '\n' || t.back() == ' ')) {
-      t.pop_back();
-    }
-    return t;
-  }
-  // A request with an optional bearer token; its status and body.
-  int send(const std::string& address, const std::string& method, const std::string& path,
-           const std::string& body, const std::string& bearer, std::string* reply = nullptr) {
-    httplib::Client client("http://" + address);
-    client.set_connection_timeout(2);
-    httplib::Headers headers;
-    if (!bearer.empty()) {
-      headers.emplace("Authorization", "Bearer " + bearer);
-    }
-    const auto res = method == "PUT" ? client.Put(path.c_str(), headers, body, "application/json")
-                                     : client.Delete(path.c_str(), headers);
-    if (!res) {
-      return -1;
-    }
-    if (reply != nullptr) {
-      *reply = res->body;
-    }
-    return res->status;
-  }
   std::string patternFile() const { return readFile(base() + "odi/dpx/tpatterns.dat"); }
 };
 
@@ -152,7 +126,10 @@ TEST_F(SituationsE2ETest, RefusedRequestsChangeNothingAndDisturbNoIngestion) {
   EXPECT_EQ(400, send(address, "PUT", path, R"({"table": "Q7NOPE"})", token(), &reply));
 
   int status = 0;
-  EXPECT_TRUE(get(address, "/api/v1/situations", &status)["situations"].empty());
+  // Only the fixture's catch-all situation is started.
+  const nlohmann::json started = get(address, "/api/v1/situations", &status)["situations"];
+  ASSERT_EQ(1u, started.size()) << started.dump();
+  EXPECT_EQ("everything", started[0]["name"]);
   EXPECT_EQ(1u, get(address, "/api/v1/tables/Q7TXPTNS", &status)["rows"].size());
 
   // Records written now still reach the tables.
