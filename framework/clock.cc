@@ -1,8 +1,10 @@
 #include "framework/clock.h"
 
 #include <atomic>
+#include <chrono>
 #include <cstdio>
 #include <cstring>
+#include <thread>
 #include <utility>
 
 #include "framework/mutex.h"
@@ -25,6 +27,19 @@ time_t Now() {
     }
   }
   return time(nullptr);
+}
+
+time_t Clock::now() const {
+  return Now();
+}
+
+void Clock::sleep(unsigned long ms) const {
+  std::this_thread::sleep_for(std::chrono::milliseconds(ms));
+}
+
+const Clock& SystemClock() {
+  static const Clock clock;
+  return clock;
 }
 
 void SetClockForTesting(std::function<time_t()> clock) {

@@ -22,6 +22,21 @@ time_t Now();
 // Replaces the wall clock; an empty function restores time().
 void SetClockForTesting(std::function<time_t()> clock);
 
+// The wall clock and waiting as an object, for the code that polls or waits: it is handed a
+// Clock, and tests hand it one whose waits are short, so polls run without real waiting.
+// Thread safety: a Clock's functions may be called from any thread.
+class Clock {
+ public:
+  virtual ~Clock() = default;
+  // Seconds since 1970 (Now()).
+  virtual time_t now() const;
+  // Waits ms milliseconds.
+  virtual void sleep(unsigned long ms) const;
+};
+
+// The process's clock: Now() and real waits.
+const Clock& SystemClock();
+
 }  // namespace fw
 
 // Writes t as a framework timestamp into out[0..15], without a terminator.

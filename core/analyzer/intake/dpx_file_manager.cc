@@ -162,7 +162,8 @@ void CDPXFileManager::Run() {
       }
       deleteFoundFiles(list);
     }
-    CMisc::napWhileBoolFalse(kPollMillis, stopFlag());
+    CMisc::napWhileBoolFalse(kPollMillis, stopFlag(),
+                             [this](unsigned long ms) { getClock().sleep(ms); });
     if (isStopRequested() && stopNoted) {
       if (currentMonitor) {
         CLOG::min("%s We had a current monitor and last offset is [%lld]", kWhere,

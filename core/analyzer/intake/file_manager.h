@@ -15,6 +15,7 @@
 #include "core/analyzer/intake/last_file_info.h"
 #include "core/analyzer/intake/transaction_sink.h"
 #include "core/runtime/cvel_thread.h"
+#include "framework/clock.h"
 
 class CFileManager : public CvelThread {
  public:
@@ -49,6 +50,10 @@ class CFileManager : public CvelThread {
   // Where monitors queue transactions (not owned; set before Start).
   void setSink(TransactionSink* sink) { this->sink = sink; }
   TransactionSink* getSink() const { return sink; }
+  // What the manager's pauses between passes wait on (not owned; the system clock unless set
+  // before Start).
+  void setClock(const fw::Clock& clock) { this->clock = &clock; }
+  const fw::Clock& getClock() const { return *clock; }
   bool isShutdownComplete() const { return shutdownComplete.load(); }
   void setShutdownComplete(bool done) { shutdownComplete.store(done); }
 
@@ -58,10 +63,11 @@ class CFileManager : public CvelThread {
   const std::atomic<bool>* stopFlag() const { return &stopRequested; }
 
  private:
-  char dirToWatch[kFileInfoMaxPath + 1] = {};  // set at construction, then by the owner
-  int excludeOutlierMillis = -1;               // ms; -1: no test
-  std::atomic<bool> stopRequested{false};      // set by Shutdown, read by the loop
-  TransactionSink* sink = nullptr;             // not owned
-  const int32_t persistRecordType = 1;         // first word of every persisted record
-  std::atomic<bool> shutdownComplete{false};   // set when the loop has returned
+  char dirToWatch[kFileInfoMaxPath + 1] = {};   // set at construction, then by the owner
+  int excludeOutlierMillis = -1;                // ms; -1: no test
+  std::atomic<bool> stopRequested{false};       // set by Shutdown, read by the loop
+  TransactionSink* sink = nullptr;              // not owned
+  const fw::Clock* clock = &fw::SystemClock();  // not owned
+  const int32_t persistRecordType = 1;          // first word of every persisted record
+  std::atomic<bool> shutdownComplete{false};    // set when the loop has returned
 };
