@@ -1,23 +1,13 @@
 #include "q7tema/exported_tables.h"
 
-#include <array>
 #include <memory>
 #include <string>
-#include <string_view>
 #include <utility>
 
 #include "framework/tables.h"
-#include "q7tema/table_registry.h"
 
 namespace q7tema {
 namespace {
-
-#define Q7_LOWER_NAME(lower, exported, COLUMNS) #lower,
-constexpr std::array<std::string_view, kTableLoadOrder.size()> kExportedOrder = {
-    Q7_EXPORTED_TABLES(Q7_LOWER_NAME)};
-#undef Q7_LOWER_NAME
-static_assert(kExportedOrder == kTableLoadOrder,
-              "Q7_EXPORTED_TABLES must list the tables in load order");
 
 // The registry traces a refusal (a second registration, say); the loader goes on either way.
 template <typename Row>
@@ -45,16 +35,3 @@ void RegisterWithFramework() {
 Q7_EXPORTED_TABLES(Q7_DEFINE_TABLE)
 
 #undef Q7_DEFINE_TABLE
-
-namespace q7tema {
-
-int RegisterExportedTableInits() {
-  int accepted = 0;
-#define Q7_REGISTER_INIT(lower, exported, COLUMNS) \
-  accepted += RegisterTableInit(#lower, kq7_##lower##_init) ? 1 : 0;
-  Q7_EXPORTED_TABLES(Q7_REGISTER_INIT)
-#undef Q7_REGISTER_INIT
-  return accepted;
-}
-
-}  // namespace q7tema

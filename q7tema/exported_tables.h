@@ -28,11 +28,3 @@
 Q7_EXPORTED_TABLES(Q7_DECLARE_TABLE_CLASSES)
 
 #undef Q7_DECLARE_TABLE_CLASSES
-
-namespace q7tema {
-
-// Hands every exported table's kq7_<table>_init to the agent loader (RegisterTableInit), so
-// that InitAllTables registers them all in load order. Returns how many were accepted.
-int RegisterExportedTableInits();
-
-}  // namespace q7tema

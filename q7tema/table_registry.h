@@ -1,35 +1,30 @@
 #pragma once
 
-// The 23 exported tables in the order the agent loader initialises them, and the hook through
-// which each table's init function is supplied. Tables whose classes are not built register
-// nothing; the loader then reports them as absent and goes on.
+// The 23 exported tables in the order the agent loader initialises them: the order of
+// Q7_EXPORTED_TABLES (core/layouts/table_layouts.h), so a table is listed once.
 //
-// Thread safety: registration happens during static initialisation or start-up on the main
-// thread; InitAllTables runs on the thread that runs the agent loader.
+// Thread safety: InitAllTables runs on the thread that runs the agent loader.
 
 #include <array>
+#include <cstddef>
 #include <string_view>
+
+#include "core/layouts/table_layouts.h"
 
 namespace q7tema {
 
+#define Q7_COUNT_TABLE(lower, exported, COLUMNS) +1
+inline constexpr std::size_t kTableCount = 0 Q7_EXPORTED_TABLES(Q7_COUNT_TABLE);
+#undef Q7_COUNT_TABLE
+
 // kq7_<name>_init names, in load order.
-inline constexpr std::array<std::string_view, 23> kTableLoadOrder = {
-    "q7agntdts",  "q7agntmsgs", "q7appot",   "q7appsm",    "q7clntapp", "q7clntot",
-    "q7clntptns", "q7clntsm",   "q7clntsrv", "q7srvappsm", "q7srvot",   "q7srvsm",
-    "q7txins",    "q7txot",     "q7txptns",  "q7txsm",     "q7txcs",    "q7appcs",
-    "q7clntcs",   "q7srvcs",    "q7subtxsm", "q7subtxot",  "q7subtxins"};
+#define Q7_LOWER_NAME(lower, exported, COLUMNS) std::string_view(#lower),
+inline constexpr std::array<std::string_view, kTableCount> kTableLoadOrder = {
+    Q7_EXPORTED_TABLES(Q7_LOWER_NAME)};
+#undef Q7_LOWER_NAME
 
-using TableInitFunction = void (*)();
-
-// Supplies the init function of the table named in kTableLoadOrder. Returns false for a name
-// that is not one of the 23.
-bool RegisterTableInit(std::string_view name, TableInitFunction init);
-
-// Calls the registered init functions in load order. Returns how many tables were initialised;
-// each table without an init function leaves one summary trace line.
+// Calls every table's kq7_<name>_init in load order, each registering its table with the
+// framework. Returns how many were initialised.
 int InitAllTables();
-
-// Forgets every init function (tests only).
-void ResetTableInitsForTesting();
 
 }  // namespace q7tema

@@ -11,7 +11,6 @@
 #include "framework/agent_runtime.h"
 #include "framework/environment.h"
 #include "framework/trace.h"
-#include "q7tema/exported_tables.h"
 #include "q7tema/table_registry.h"
 #include "tama/agent_config.h"
 #include "tama/agent_globals.h"
@@ -80,7 +79,6 @@ int LoadAgents() {
   fw::DeclareAffinity("AFF_FEAT_INTERNATIONALIZATION");
   fw::DeclareAffinity("AFF_V1");
   fw::DeclareAffinity("0000000000000000000100000000000000000000000");
-  q7tema::RegisterExportedTableInits();
   const int tables = q7tema::InitAllTables();
   Q7_TRACE(kUnit, fw::kTraceDetail, "%d of %zu tables initialised", tables,
            q7tema::kTableLoadOrder.size());

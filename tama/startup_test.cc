@@ -17,7 +17,6 @@
 #include "framework/agent_runtime.h"
 #include "framework/tables.h"
 #include "framework/trace_capture.h"
-#include "q7tema/table_registry.h"
 #include "tama/agent.h"
 #include "tama/agent_globals.h"
 #include "tama/signal_manager.h"
@@ -91,7 +90,6 @@ TEST_F(StartupTest, LoaderAndCommandCallback) {
   EXPECT_EQ("Q7AGNTDTS", tables.front()->name);
   EXPECT_EQ("Q7SUBTXINS", tables.back()->name);
   fw::ResetTablesForTesting();
-  q7tema::ResetTableInitsForTesting();
   const std::vector<std::string> expected{"AFF_FEAT_DM_PARITY", "AFF_FEAT_AGENT_MGMT",
                                           "AFF_FEAT_INTERNATIONALIZATION", "AFF_V1",
                                           "0000000000000000000100000000000000000000000"};
