@@ -30,6 +30,14 @@ inline constexpr int kColumnLongText = 12;
 }  // namespace q7tema
 
 // clang-format off
+// The web times and counts, shared by the aggregate rows (as per-request averages) and the
+// instance rows (one transaction's values).
+#define Q7_WEB_TIMES(COL) \
+  COL(I, clienttime, 4) COL(I, loadtime, 4) COL(I, netwtime, 4) COL(I, servtime, 4) \
+  COL(I, resolvtime, 4) COL(I, reqpacket, 4) COL(I, ackpacket, 4) COL(I, replypckt, 4) \
+  COL(I, replyack, 4) COL(I, totbytes, 4) COL(I, reqbytes, 4) COL(I, replybyt, 4) \
+  COL(I, objcnt, 4) COL(I, objsize, 4) COL(I, headrreq, 4) COL(I, hdrreqrslv, 4)
+
 // ---- The shared aggregate columns (AGG), in four runs around the optional columns. ----
 
 #define Q7_AGG_COUNTS(COL) \
@@ -40,10 +48,7 @@ inline constexpr int kColumnLongText = 12;
   COL(I, minrtt, 4) COL(I, maxrtt, 4) COL(S, datcoltype, 32) COL(S, sampletime, 16) \
   COL(I, rank, 4)
 #define Q7_AGG_WEB(COL) \
-  COL(I, clienttime, 4) COL(I, loadtime, 4) COL(I, netwtime, 4) COL(I, servtime, 4) \
-  COL(I, resolvtime, 4) COL(I, reqpacket, 4) COL(I, ackpacket, 4) COL(I, replypckt, 4) \
-  COL(I, replyack, 4) COL(I, totbytes, 4) COL(I, reqbytes, 4) COL(I, replybyt, 4) \
-  COL(I, objcnt, 4) COL(I, objsize, 4) COL(I, headrreq, 4) COL(I, hdrreqrslv, 4) \
+  Q7_WEB_TIMES(COL) \
   COL(I, num1xx, 4) COL(I, num2xx, 4) COL(I, num3xx, 4) COL(I, num4xx, 4) COL(I, num5xx, 4) \
   COL(I, num403, 4) COL(I, num404, 4) COL(I, num500, 4)
 #define Q7_AGG_PCTS(COL) \
@@ -101,17 +106,12 @@ inline constexpr int kColumnLongText = 12;
   COL(S, browsedesc, 254) COL(S, serverdesc, 254) COL(S, approtocol, 32) COL(S, urlhost, 254) \
   COL(S, urlpath, 254) COL(S, urlfile, 254) COL(S, urlquery, 254) COL(S, urlanchor, 126) \
   COL(S, pagetitle, 254) COL(H, method, 2)
-#define Q7_INS_TIMES(COL) \
-  COL(I, clienttime, 4) COL(I, loadtime, 4) COL(I, netwtime, 4) COL(I, servtime, 4) \
-  COL(I, resolvtime, 4) COL(I, reqpacket, 4) COL(I, ackpacket, 4) COL(I, replypckt, 4) \
-  COL(I, replyack, 4) COL(I, totbytes, 4) COL(I, reqbytes, 4) COL(I, replybyt, 4) \
-  COL(I, objcnt, 4) COL(I, objsize, 4) COL(I, headrreq, 4) COL(I, hdrreqrslv, 4)
 #define Q7_COLS_TXINS(COL) \
   Q7_INS_NAMES(COL) COL(I, mrtthres, 4) COL(S, datcoltype, 32) COL(H, importance, 2) \
-  Q7_INS_LINE(COL) COL(I, aggby, 4) Q7_INS_TIMES(COL) COL(S, instroot, 16)
+  Q7_INS_LINE(COL) COL(I, aggby, 4) Q7_WEB_TIMES(COL) COL(S, instroot, 16)
 #define Q7_COLS_SUBTXINS(COL) \
   Q7_INS_NAMES(COL) COL(S, datcoltype, 32) Q7_INS_LINE(COL) COL(S, parentuuid, 32) \
-  COL(S, curruuid, 32) COL(S, instroot, 16) Q7_INS_TIMES(COL)
+  COL(S, curruuid, 32) COL(S, instroot, 16) Q7_WEB_TIMES(COL)
 
 // ---- Pattern and agent tables. ----
 

@@ -28,15 +28,19 @@ bool TSAVLTree::removeNode(TreeNode* key) {
   return removeNode(key, true);
 }
 
-TreeNode* TSAVLTree::findNode(TreeNode* key) {
-  CvelMutexLock hold(mutex);
-  return AVLTree::findNode(key);
-}
-
-TreeNode* TSAVLTree::getLarger(TreeNode* key) {
-  CvelMutexLock hold(mutex);
-  return AVLTree::getLarger(key);
-}
+// The key operations: the base operation with the mutex held for its whole run.
+#define Q7_LOCKED_KEY_OPERATION(Result, name) \
+  Result TSAVLTree::name(TreeNode* key) {     \
+    CvelMutexLock hold(mutex);                \
+    return AVLTree::name(key);                \
+  }
+Q7_LOCKED_KEY_OPERATION(TreeNode*, findNode)
+Q7_LOCKED_KEY_OPERATION(TreeNode*, getLarger)
+Q7_LOCKED_KEY_OPERATION(TreeNode*, markForDeletion)
+Q7_LOCKED_KEY_OPERATION(TreeNode*, AddRef)
+Q7_LOCKED_KEY_OPERATION(TreeNode*, Release)
+Q7_LOCKED_KEY_OPERATION(int32_t, getRefCount)
+#undef Q7_LOCKED_KEY_OPERATION
 
 // The dumps call the base dumpATree directly: the overridden one would take the mutex again.
 void TSAVLTree::dumpTree() {
@@ -56,24 +60,4 @@ void TSAVLTree::dumpSortedTree() {
 void TSAVLTree::dumpATree(bool sorted, int* count, int* depth) {
   CvelMutexLock hold(mutex);
   AVLTree::dumpATree(sorted, count, depth);
-}
-
-TreeNode* TSAVLTree::markForDeletion(TreeNode* key) {
-  CvelMutexLock hold(mutex);
-  return AVLTree::markForDeletion(key);
-}
-
-TreeNode* TSAVLTree::AddRef(TreeNode* key) {
-  CvelMutexLock hold(mutex);
-  return AVLTree::AddRef(key);
-}
-
-TreeNode* TSAVLTree::Release(TreeNode* key) {
-  CvelMutexLock hold(mutex);
-  return AVLTree::Release(key);
-}
-
-int32_t TSAVLTree::getRefCount(TreeNode* key) {
-  CvelMutexLock hold(mutex);
-  return AVLTree::getRefCount(key);
 }

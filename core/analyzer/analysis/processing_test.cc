@@ -103,6 +103,9 @@ TEST_F(ProcessingTest, ClientIdentity) {
   EXPECT_EQ(1, clients["ClientName=10.9.9.9\nServerName=192.0.2.10\n"]);
   EXPECT_EQ(2, clients["ClientName=10.1.2.*\nServerName=192.0.2.10\n"]);
   EXPECT_EQ(1, clients["ClientName=Lab\nServerName=192.0.2.10\n"]);
+  // The cut reaches the address and host name too: the client rows key on all three.
+  auto clientRows = Rows(OverTimeTable::kClient);
+  EXPECT_EQ(2, clientRows["ClientName=10.1.2.*\nIPAddress=10.1.2.*\nHostname=10.1.2.*\n"]);
 }
 
 // A transaction older than the reference interval is counted into it; one that is then still

@@ -184,56 +184,51 @@ Layout* CDPXAnalyzer::lockedQuery(Inner inner, int* count) {
 
 // ---- The named queries. ----
 
-#define Q7_OVER_TIME(name, table, Row)                                                           \
-  kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count,               \
-                                                       bool currentOnly) {                       \
-    return overTimeQuery<Row>(OverTimeTable::table, "i_get_tbl" #name, sampleType, count,        \
-                              currentOnly);                                                      \
-  }                                                                                              \
-  kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) {               \
-    return lockedQuery<kq7_q7##name##_data_t>(                                                   \
-        [&]() REQUIRES(treeMutex) { return i_get_tbl##name(sampleType, count, false); }, count); \
+// The public query over each inner one: the inner query under the tree lock, then the sample
+// time. Extra arguments go to the inner query after sampleType and count.
+#define Q7_LOCKED_QUERY(name, ...)                                                 \
+  kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) { \
+    return lockedQuery<kq7_q7##name##_data_t>(                                     \
+        [&]() REQUIRES(treeMutex) {                                                \
+          return i_get_tbl##name(sampleType, count __VA_OPT__(, ) __VA_ARGS__);    \
+        },                                                                         \
+        count);                                                                    \
   }
-Q7_OVER_TIME(appot, kApplication, CApplicationOverTime)
-Q7_OVER_TIME(clntappot, kClientApp, CClientAppOverTime)
-Q7_OVER_TIME(clntot, kClient, CClientOverTime)
-Q7_OVER_TIME(clntsrvot, kClientServer, CClientServerOverTime)
-Q7_OVER_TIME(srvappot, kServerApp, CServerAppOverTime)
-Q7_OVER_TIME(srvot, kServer, CServerOverTime)
-Q7_OVER_TIME(txot, kTransaction, CTransactionOverTime)
-Q7_OVER_TIME(subtxot, kSubTransaction, CSubTransactionOverTime)
-#undef Q7_OVER_TIME
 
-#define Q7_SUMMARY(name, overTime, Row)                                                         \
-  kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count) {            \
-    return summaryQuery<Row>(&CDPXAnalyzer::i_get_tbl##overTime, "i_get_tbl" #name, sampleType, \
-                             count);                                                            \
-  }                                                                                             \
-  kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) {              \
-    return lockedQuery<kq7_q7##name##_data_t>(                                                  \
-        [&]() REQUIRES(treeMutex) { return i_get_tbl##name(sampleType, count); }, count);       \
-  }
-Q7_SUMMARY(appsm, appot, CApplicationSummary)
-Q7_SUMMARY(clntapp, clntappot, CClientAppSummary)
-Q7_SUMMARY(clntsm, clntot, CClientSummary)
-Q7_SUMMARY(clntsrv, clntsrvot, CClientServerSummary)
-Q7_SUMMARY(srvappsm, srvappot, CServerAppSummary)
-Q7_SUMMARY(srvsm, srvot, CServerSummary)
-Q7_SUMMARY(txsm, txot, CTransactionSummary)
-Q7_SUMMARY(subtxsm, subtxot, CSubTransactionSummary)
-#undef Q7_SUMMARY
+// An over-time table and the summary folded from it: the over-time name, tree and row class,
+// then the summary name and row class.
+#define Q7_OVER_TIME_AND_SUMMARY(ot, table, OverTimeRow, sm, SummaryRow)                           \
+  kq7_q7##ot##_data_t* CDPXAnalyzer::i_get_tbl##ot(int sampleType, int* count, bool currentOnly) { \
+    return overTimeQuery<OverTimeRow>(OverTimeTable::table, "i_get_tbl" #ot, sampleType, count,    \
+                                      currentOnly);                                                \
+  }                                                                                                \
+  kq7_q7##sm##_data_t* CDPXAnalyzer::i_get_tbl##sm(int sampleType, int* count) {                   \
+    return summaryQuery<SummaryRow>(&CDPXAnalyzer::i_get_tbl##ot, "i_get_tbl" #sm, sampleType,     \
+                                    count);                                                        \
+  }                                                                                                \
+  Q7_LOCKED_QUERY(ot, false)                                                                       \
+  Q7_LOCKED_QUERY(sm)
+Q7_OVER_TIME_AND_SUMMARY(appot, kApplication, CApplicationOverTime, appsm, CApplicationSummary)
+Q7_OVER_TIME_AND_SUMMARY(clntappot, kClientApp, CClientAppOverTime, clntapp, CClientAppSummary)
+Q7_OVER_TIME_AND_SUMMARY(clntot, kClient, CClientOverTime, clntsm, CClientSummary)
+Q7_OVER_TIME_AND_SUMMARY(clntsrvot, kClientServer, CClientServerOverTime, clntsrv,
+                         CClientServerSummary)
+Q7_OVER_TIME_AND_SUMMARY(srvappot, kServerApp, CServerAppOverTime, srvappsm, CServerAppSummary)
+Q7_OVER_TIME_AND_SUMMARY(srvot, kServer, CServerOverTime, srvsm, CServerSummary)
+Q7_OVER_TIME_AND_SUMMARY(txot, kTransaction, CTransactionOverTime, txsm, CTransactionSummary)
+Q7_OVER_TIME_AND_SUMMARY(subtxot, kSubTransaction, CSubTransactionOverTime, subtxsm,
+                         CSubTransactionSummary)
+#undef Q7_OVER_TIME_AND_SUMMARY
 
 #define Q7_INSTANCE(name)                                                                          \
   kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count) {               \
     return instanceQuery<kq7_q7##name##_data_t>("q7" #name, "i_get_tbl" #name, sampleType, count); \
   }                                                                                                \
-  kq7_q7##name##_data_t* CDPXAnalyzer::get_tbl##name(int sampleType, int* count) {                 \
-    return lockedQuery<kq7_q7##name##_data_t>(                                                     \
-        [&]() REQUIRES(treeMutex) { return i_get_tbl##name(sampleType, count); }, count);          \
-  }
+  Q7_LOCKED_QUERY(name)
 Q7_INSTANCE(txins)
 Q7_INSTANCE(subtxins)
 #undef Q7_INSTANCE
+#undef Q7_LOCKED_QUERY
 
 #define Q7_CURRENT_STATUS(cs, ot)                                              \
   kq7_q7##cs##_data_t* CDPXAnalyzer::get_tbl##cs(int sampleType, int* count) { \

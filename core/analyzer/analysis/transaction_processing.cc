@@ -61,12 +61,17 @@ void UpdatePageTables(COverTimeTrees& trees, CDPXTransaction& w) {
                                   "Error adding to CAOT tree!");
 }
 
-void ToSubnet(char* text, size_t size) {
+// Sets the client field of w whose text is value to its first three address parts, cut to the
+// field's width.
+void CutToSubnet(CDPXTransaction& w, const char* value, void (CTransaction::*set)(const char*)) {
+  char text[kTransactionNameWidth];
+  snprintf(text, sizeof(text), "%s", value);
   char out[kTransactionNameWidth + 2];
   CCommon::stripToSubnet(text, out, 3);
-  const size_t length = strnlen(out, size - 1);
+  const size_t length = strnlen(out, sizeof(text) - 1);
   memcpy(text, out, length);
   text[length] = '\0';
+  (w.*set)(text);
 }
 
 // The made-up matches of an object and of a client no pattern names: built once, since a
@@ -134,19 +139,10 @@ int ApplyClientPattern(CDPXTransaction& w, const ClientPattern& cp) {
     w.setClientIPAddress(cp.clientName);
     return 0;
   }
-  char text[kTransactionNameWidth];
-  snprintf(text, sizeof(text), "%s", w.getClientName());
-  ToSubnet(text, sizeof(text));
-  w.setClientName(text);
-  snprintf(text, sizeof(text), "%s", w.getClientHostname());
-  ToSubnet(text, sizeof(text));
-  w.setClientHostname(text);
-  snprintf(text, sizeof(text), "%s", w.getClientIPAddress());
-  ToSubnet(text, sizeof(text));
-  w.setClientIPAddress(text);
-  snprintf(text, sizeof(text), "%s", w.getClientIPv6Address());
-  ToSubnet(text, sizeof(text));
-  w.setClientIPv6Address(text);
+  CutToSubnet(w, w.getClientName(), &CTransaction::setClientName);
+  CutToSubnet(w, w.getClientHostname(), &CTransaction::setClientHostname);
+  CutToSubnet(w, w.getClientIPAddress(), &CTransaction::setClientIPAddress);
+  CutToSubnet(w, w.getClientIPv6Address(), &CTransaction::setClientIPv6Address);
   return 0;
 }
 

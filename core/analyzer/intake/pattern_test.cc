@@ -3,6 +3,7 @@
 
 #include <random>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "core/analyzer/intake/common.h"
@@ -94,27 +95,39 @@ bool Matches(const char* pattern, const char* text) {
 }
 
 TEST(PatternMatchTest, Wildcards) {
-  EXPECT_FALSE(Matches("", ""));
-  EXPECT_FALSE(Matches("", "abc"));
-  EXPECT_TRUE(Matches("*", ""));
-  EXPECT_TRUE(Matches("*", "anything"));
-  EXPECT_FALSE(Matches("**", "anything"));
+  // Pattern and text.
+  using Case = std::pair<const char*, const char*>;
+  const Case kMatching[] = {
+      {"*", ""},
+      {"*", "anything"},
+      {"***abc", "xxabc"},
+      {"a**b", "a-b"},
+      {"a**b", "ab"},
+      {"ab*ab", "abab"},
+      {"a*", "a"},
+      {"*.JSP", "/x/index.jsp"},
+      {"/APP/*", "/app/x"},
+      {"*b*d*", "abcde"},
+      {"*ab*ab", "xabab"},
+  };
+  for (const auto& [pattern, text] : kMatching) {
+    EXPECT_TRUE(Matches(pattern, text)) << pattern << " / " << text;
+  }
+  const Case kNotMatching[] = {
+      {"", ""},
+      {"", "abc"},
+      {"**", "anything"},
+      {"***abc", "abcx"},
+      {"ab*ab", "ab"},  // the end must not overlap the start
+      {"abc", "abcd"},
+      {"*d*b*", "abcde"},   // CONTAINS parts in order
+      {"*aba*ba", "xaba"},  // ENDSWITH begins before the position
+  };
+  for (const auto& [pattern, text] : kNotMatching) {
+    EXPECT_FALSE(Matches(pattern, text)) << pattern << " / " << text;
+  }
   EXPECT_FALSE(Matches(nullptr, "x"));
   EXPECT_FALSE(Matches("*", nullptr));
-  EXPECT_TRUE(Matches("***abc", "xxabc"));
-  EXPECT_FALSE(Matches("***abc", "abcx"));
-  EXPECT_TRUE(Matches("a**b", "a-b"));
-  EXPECT_TRUE(Matches("a**b", "ab"));
-  EXPECT_FALSE(Matches("ab*ab", "ab"));  // the end must not overlap the start
-  EXPECT_TRUE(Matches("ab*ab", "abab"));
-  EXPECT_TRUE(Matches("a*", "a"));
-  EXPECT_TRUE(Matches("*.JSP", "/x/index.jsp"));
-  EXPECT_TRUE(Matches("/APP/*", "/app/x"));
-  EXPECT_FALSE(Matches("abc", "abcd"));
-  EXPECT_TRUE(Matches("*b*d*", "abcde"));
-  EXPECT_FALSE(Matches("*d*b*", "abcde"));  // CONTAINS parts in order
-  EXPECT_TRUE(Matches("*ab*ab", "xabab"));
-  EXPECT_FALSE(Matches("*aba*ba", "xaba"));  // ENDSWITH begins before the position
 }
 
 TEST(PatternMatchTest, NonAsciiFoldsCase) {

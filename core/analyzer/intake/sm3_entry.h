@@ -47,31 +47,37 @@ struct SM3_RECORD_TAGS {
 // The four kinds in the order they are searched for: hpage, hobj, audio, video.
 extern const SM3_RECORD_TAGS SM3_RECORD_KINDS[4];
 
+// Fields 1 to 22, the same in both line layouts. iTransTime is seconds since 1970, UTC;
+// szIPSourceAddress is the client and szIPDestinationAddress the server; iTotalResponseTime is
+// in ms.
+#define SM3_SHARED_ENTRY_FIELDS    \
+  char szProductVersion[11];       \
+  char szApplicationID[3];         \
+  char szReserved1[65];            \
+  char szCollectorID[32];          \
+  char szTransGUID[65];            \
+  int32_t iTransTime;              \
+  char szTransDate[11];            \
+  char szTransTimeString[9];       \
+  int32_t iGMTOffset;              \
+  char szTimeZone[33];             \
+  char szIPSourceAddress[65];      \
+  int32_t iSourcePort;             \
+  char szIPDestinationAddress[65]; \
+  int32_t iDestinationPort;        \
+  int32_t iTotalResponseTime;      \
+  int32_t iRequestPacketCount;     \
+  int32_t iRequestAckPacketCount;  \
+  int32_t iReplyPacketCount;       \
+  int32_t iReplyAckPacketCount;    \
+  int32_t iTotalBytes;             \
+  int32_t iRequestBytes;           \
+  int32_t iReplyBytes;
+
 // A page line (record types 1 and 2), the 46 fields in line order. Text slots keep at most
 // width - 1 characters. Trans date and Trans time string are skipped by the parser and stay empty.
 struct SM3_HPAGE_ENTRY {
-  char szProductVersion[11];
-  char szApplicationID[3];
-  char szReserved1[65];
-  char szCollectorID[32];
-  char szTransGUID[65];
-  int32_t iTransTime;  // seconds since 1970, UTC
-  char szTransDate[11];
-  char szTransTimeString[9];
-  int32_t iGMTOffset;
-  char szTimeZone[33];
-  char szIPSourceAddress[65];  // the client
-  int32_t iSourcePort;
-  char szIPDestinationAddress[65];  // the server
-  int32_t iDestinationPort;
-  int32_t iTotalResponseTime;  // ms
-  int32_t iRequestPacketCount;
-  int32_t iRequestAckPacketCount;
-  int32_t iReplyPacketCount;
-  int32_t iReplyAckPacketCount;
-  int32_t iTotalBytes;
-  int32_t iRequestBytes;
-  int32_t iReplyBytes;
+  SM3_SHARED_ENTRY_FIELDS
   char szURL[255];
   char szReferrerURL[255];
   char szBrowserDescription[255];
@@ -101,28 +107,7 @@ struct SM3_HPAGE_ENTRY {
 // An audio or video line (record types 3 and 4), the 31 fields in line order. Fields 1 to 22
 // are those of the page line, laid out identically.
 struct _SM3_AV_ENTRY {
-  char szProductVersion[11];
-  char szApplicationID[3];
-  char szReserved1[65];
-  char szCollectorID[32];
-  char szTransGUID[65];
-  int32_t iTransTime;
-  char szTransDate[11];
-  char szTransTimeString[9];
-  int32_t iGMTOffset;
-  char szTimeZone[33];
-  char szIPSourceAddress[65];
-  int32_t iSourcePort;
-  char szIPDestinationAddress[65];
-  int32_t iDestinationPort;
-  int32_t iTotalResponseTime;
-  int32_t iRequestPacketCount;
-  int32_t iRequestAckPacketCount;
-  int32_t iReplyPacketCount;
-  int32_t iReplyAckPacketCount;
-  int32_t iTotalBytes;
-  int32_t iRequestBytes;
-  int32_t iReplyBytes;
+  SM3_SHARED_ENTRY_FIELDS
   int32_t iObjectValue1;  // kept here only; not carried into a page entry
   char szURL[255];
   char szReferrerURL[255];
@@ -133,6 +118,7 @@ struct _SM3_AV_ENTRY {
   int32_t iObjectValue2;  // kept here only; not carried into a page entry
   int32_t iNetworkTime;   // ms; read from the line's first character only
 };
+#undef SM3_SHARED_ENTRY_FIELDS
 
 // The shared leading fields must sit at the same offsets, so they convert as one block.
 static_assert(offsetof(SM3_HPAGE_ENTRY, iReplyBytes) == offsetof(_SM3_AV_ENTRY, iReplyBytes));

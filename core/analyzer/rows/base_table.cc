@@ -261,27 +261,12 @@ void reaggregateCommonData(common_data_t& row, int32_t totreq, int32_t failreq, 
 }
 
 void reaggregateDPXData(dpx_data_t& row, const dpx_data_t& other) {
-  row.loadtime += other.loadtime;
-  row.resolvtime += other.resolvtime;
-  row.reqpacket += other.reqpacket;
-  row.ackpacket += other.ackpacket;
-  row.replypckt += other.replypckt;
-  row.replyack += other.replyack;
-  row.totbytes += other.totbytes;
-  row.reqbytes += other.reqbytes;
-  row.replybyt += other.replybyt;
-  row.objcnt += other.objcnt;
-  row.objsize += other.objsize;
-  row.headrreq += other.headrreq;
-  row.hdrreqrslv += other.hdrreqrslv;
-  row.num1xx += other.num1xx;
-  row.num2xx += other.num2xx;
-  row.num3xx += other.num3xx;
-  row.num4xx += other.num4xx;
-  row.num5xx += other.num5xx;
-  row.num403 += other.num403;
-  row.num404 += other.num404;
-  row.num500 += other.num500;
+#define Q7_ADD_SUM(sum) row.sum += other.sum;
+  Q7_DPX_SUMS(Q7_ADD_SUM)
+#undef Q7_ADD_SUM
+#define Q7_ADD_COUNT(code) row.num##code += other.num##code;
+  Q7_DPX_STATUS_CODES(Q7_ADD_COUNT)
+#undef Q7_ADD_COUNT
 }
 
 void reaggregateARMData(carm_data_t& row, const carm_data_t& other) {

@@ -44,6 +44,20 @@ struct dpx_data_t {
   int32_t num1xx, num2xx, num3xx, num4xx, num5xx, num403, num404, num500;
 };
 
+// The web block's fields for the code that walks them all: the sums (per-request averages in
+// table rows), and the status codes whose counts are num<code> (pct<code> in table rows).
+// clang-format off
+#define Q7_DPX_SUMS(X) \
+  X(loadtime) X(resolvtime) X(reqpacket) X(ackpacket) X(replypckt) X(replyack) X(totbytes) \
+  X(reqbytes) X(replybyt) X(objcnt) X(objsize) X(headrreq) X(hdrreqrslv)
+// clang-format on
+#define Q7_DPX_STATUS_CODES(X) X(1xx) X(2xx) X(3xx) X(4xx) X(5xx) X(403) X(404) X(500)
+#define Q7_DPX_PLUS_ONE(field) +1
+static_assert(sizeof(dpx_data_t) == sizeof(int64_t) * (0 Q7_DPX_SUMS(Q7_DPX_PLUS_ONE)) +
+                                        sizeof(int32_t) * (0 Q7_DPX_STATUS_CODES(Q7_DPX_PLUS_ONE)),
+              "a web block field is missing from its lists");
+#undef Q7_DPX_PLUS_ONE
+
 struct carm_data_t {
   int64_t totsvrrt, totcntt, totdnst, totrslvt;
 };
@@ -83,11 +97,21 @@ int32_t perRequest(int64_t sum, int32_t n);
 // (a * 100 + b) * (100 - c), wrapping in 32 bits.
 long calculateRank(long a, long b, short c);
 
-// The common columns of a table row and the values getCommonData produces for them.
+// The common columns of a table row and the values getCommonData produces for them; the list
+// is for code that copies them all.
 struct CommonColumns {
   int32_t dintval, pcfail, pcslow, pcgood, pcavail, oatime, failreq, totreq, slowreq, succreq,
       minrtt, maxrtt, clienttime, netwtime, servtime;
 };
+// clang-format off
+#define Q7_COMMON_COLUMNS(X) \
+  X(dintval) X(pcfail) X(pcslow) X(pcgood) X(pcavail) X(oatime) X(failreq) X(totreq) X(slowreq) \
+  X(succreq) X(minrtt) X(maxrtt) X(clienttime) X(netwtime) X(servtime)
+// clang-format on
+#define Q7_COMMON_PLUS_ONE(column) +1
+static_assert(sizeof(CommonColumns) == sizeof(int32_t) * (0 Q7_COMMON_COLUMNS(Q7_COMMON_PLUS_ONE)),
+              "a common column is missing from its list");
+#undef Q7_COMMON_PLUS_ONE
 
 class CBaseTable : public TreeNode {
  public:

@@ -143,27 +143,12 @@ LayoutValues ValuesOf(const Layout& row) {
   v.common.netwtime = row.netwtime * n;
   v.common.servtime = row.servtime * n;
   dpx_data_t& d = v.dpx;
-  d.loadtime = row.loadtime * n;
-  d.resolvtime = row.resolvtime * n;
-  d.reqpacket = row.reqpacket * n;
-  d.ackpacket = row.ackpacket * n;
-  d.replypckt = row.replypckt * n;
-  d.replyack = row.replyack * n;
-  d.totbytes = row.totbytes * n;
-  d.reqbytes = row.reqbytes * n;
-  d.replybyt = row.replybyt * n;
-  d.objcnt = row.objcnt * n;
-  d.objsize = row.objsize * n;
-  d.headrreq = row.headrreq * n;
-  d.hdrreqrslv = row.hdrreqrslv * n;
-  d.num1xx = row.num1xx;
-  d.num2xx = row.num2xx;
-  d.num3xx = row.num3xx;
-  d.num4xx = row.num4xx;
-  d.num5xx = row.num5xx;
-  d.num403 = row.num403;
-  d.num404 = row.num404;
-  d.num500 = row.num500;
+#define Q7_SUM_OF_AVERAGE(sum) d.sum = row.sum * n;
+  Q7_DPX_SUMS(Q7_SUM_OF_AVERAGE)
+#undef Q7_SUM_OF_AVERAGE
+#define Q7_COPY_COUNT(code) d.num##code = row.num##code;
+  Q7_DPX_STATUS_CODES(Q7_COPY_COUNT)
+#undef Q7_COPY_COUNT
   return v;
 }
 
@@ -271,55 +256,22 @@ class TKeyedRow : public CBaseTable {
     CopyField(row.datcoltype, "DPX", sizeof(row.datcoltype));
 
     const CommonColumns c = getCommonData();
-    row.dintval = c.dintval;
-    row.pcfail = c.pcfail;
-    row.pcslow = c.pcslow;
-    row.pcgood = c.pcgood;
-    row.pcavail = c.pcavail;
-    row.oatime = c.oatime;
-    row.failreq = c.failreq;
-    row.totreq = c.totreq;
-    row.slowreq = c.slowreq;
-    row.succreq = c.succreq;
-    row.minrtt = c.minrtt;
-    row.maxrtt = c.maxrtt;
-    row.clienttime = c.clienttime;
-    row.netwtime = c.netwtime;
-    row.servtime = c.servtime;
+#define Q7_COPY_COMMON(column) row.column = c.column;
+    Q7_COMMON_COLUMNS(Q7_COPY_COMMON)
+#undef Q7_COPY_COMMON
     row.rank =
         static_cast<int32_t>(calculateRank(c.pcfail / 1000, c.pcslow / 1000, carried_.importance));
 
     const int32_t n = commonData.totreq;
     const dpx_data_t& d = kindData.dpx;
-    row.loadtime = perRequest(d.loadtime, n);
-    row.resolvtime = perRequest(d.resolvtime, n);
-    row.reqpacket = perRequest(d.reqpacket, n);
-    row.ackpacket = perRequest(d.ackpacket, n);
-    row.replypckt = perRequest(d.replypckt, n);
-    row.replyack = perRequest(d.replyack, n);
-    row.totbytes = perRequest(d.totbytes, n);
-    row.reqbytes = perRequest(d.reqbytes, n);
-    row.replybyt = perRequest(d.replybyt, n);
-    row.objcnt = perRequest(d.objcnt, n);
-    row.objsize = perRequest(d.objsize, n);
-    row.headrreq = perRequest(d.headrreq, n);
-    row.hdrreqrslv = perRequest(d.hdrreqrslv, n);
-    row.num1xx = d.num1xx;
-    row.num2xx = d.num2xx;
-    row.num3xx = d.num3xx;
-    row.num4xx = d.num4xx;
-    row.num5xx = d.num5xx;
-    row.num403 = d.num403;
-    row.num404 = d.num404;
-    row.num500 = d.num500;
-    row.pct1xx = percentOfRequests(d.num1xx, n);
-    row.pct2xx = percentOfRequests(d.num2xx, n);
-    row.pct3xx = percentOfRequests(d.num3xx, n);
-    row.pct4xx = percentOfRequests(d.num4xx, n);
-    row.pct5xx = percentOfRequests(d.num5xx, n);
-    row.pct403 = percentOfRequests(d.num403, n);
-    row.pct404 = percentOfRequests(d.num404, n);
-    row.pct500 = percentOfRequests(d.num500, n);
+#define Q7_AVERAGE(sum) row.sum = perRequest(d.sum, n);
+    Q7_DPX_SUMS(Q7_AVERAGE)
+#undef Q7_AVERAGE
+#define Q7_COUNT_AND_PERCENT(code) \
+  row.num##code = d.num##code;     \
+  row.pct##code = percentOfRequests(d.num##code, n);
+    Q7_DPX_STATUS_CODES(Q7_COUNT_AND_PERCENT)
+#undef Q7_COUNT_AND_PERCENT
   }
 
  private:
