@@ -174,6 +174,9 @@ void CDPXDataFileMonitor::Run() {
   RecordHandler handler(*sink, getExcludeOutlierMillis());
   sink->intakeCounters().reading(getFile(), getLastProcessedOffset());
   while (!isShutdownRequested()) {
+    // Taken before looking for updates: a monitor turned static during this pass (a rollover)
+    // may have missed what was appended just before, so it looks once more before stopping.
+    const bool staticAtStart = isStatic.load();
     bool updates = anyUpdates();
     if (!updates) {
       const bool renamed = handleLegacyDPXRename();
@@ -204,7 +207,7 @@ void CDPXDataFileMonitor::Run() {
         CLOG::trace(kFlowFlag, "Failed to read in any new file contents");
       }
     }
-    if (isStatic.load() && !updates) {
+    if (staticAtStart && !updates) {
       Shutdown();
     }
     if (handler.wasRefused()) {
