@@ -14,25 +14,24 @@ namespace tama {
 
 namespace {
 
-// The exported row tables the analyzer answers.
-#define Q7_ANALYZER_ROW_TABLES(X) \
-  X(appot)                        \
-  X(appsm)                        \
-  X(clntapp)                      \
-  X(clntot)                       \
-  X(clntsm)                       \
-  X(clntsrv)                      \
-  X(srvappsm)                     \
-  X(srvot)                        \
-  X(srvsm)                        \
-  X(txins) X(txot) X(txsm) X(txcs) X(appcs) X(clntcs) X(srvcs) X(subtxsm) X(subtxot) X(subtxins)
-
+// Each exported table the analyzer answers samples through its query (the over-time
+// pairings kept only as history have no table).
 void installRowQueries() {
 #define Q7_ROW_QUERY(name)                                                       \
   q7tema::SetRowQuery<kq7_q7##name##_data_t>([](int sampleType, int* count) {    \
     return CDPXAnalyzer::GetInstanceNoStart()->get_tbl##name(sampleType, count); \
   });
-  Q7_ANALYZER_ROW_TABLES(Q7_ROW_QUERY)
+#define Q7_ROW_QUERY_EXPORTED(name) Q7_ROW_QUERY(name)
+#define Q7_ROW_QUERY_HISTORY_ONLY(name)
+#define Q7_OVER_TIME_QUERY(name, Row, keys, Tree, EXPORT) Q7_ROW_QUERY_##EXPORT(name)
+#define Q7_SUMMARY_QUERY(name, Row, keys, overTime) Q7_ROW_QUERY(name)
+#define Q7_CURRENT_QUERY(name, overTime, COLUMNS) Q7_ROW_QUERY(name)
+  Q7_ANALYZER_TABLES(Q7_OVER_TIME_QUERY, Q7_SUMMARY_QUERY, Q7_CURRENT_QUERY, Q7_ROW_QUERY)
+#undef Q7_CURRENT_QUERY
+#undef Q7_SUMMARY_QUERY
+#undef Q7_OVER_TIME_QUERY
+#undef Q7_ROW_QUERY_HISTORY_ONLY
+#undef Q7_ROW_QUERY_EXPORTED
 #undef Q7_ROW_QUERY
   q7tema::SetRowQuery<kq7_q7agntdts_data_t>(&getAgentDetailRows);
   q7tema::SetRowQuery<kq7_q7agntmsgs_data_t>(&getAgentMessageRows);

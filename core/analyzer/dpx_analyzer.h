@@ -65,23 +65,23 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // releases with delete[], and their count through count (null with 0). Only sample type 3
   // yields rows. The public ones take the tree lock, flush the cache and stamp sampletime; the
   // inner ones (i_get_tbl...) run with the lock held. ----
-#define Q7_DECLARE_OVER_TIME_QUERY(name)                                               \
+#define Q7_DECLARE_OVER_TIME_QUERY(name, Row, keys, Tree, EXPORT)                      \
   kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count);                    \
   kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count, bool currentOnly) \
       REQUIRES(treeMutex);
 #define Q7_DECLARE_QUERY(name)                                      \
   kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count); \
   kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count) REQUIRES(treeMutex);
-  Q7_OVER_TIME_QUERIES(Q7_DECLARE_OVER_TIME_QUERY)
-  Q7_SUMMARY_QUERIES(Q7_DECLARE_QUERY)
-  Q7_INSTANCE_QUERIES(Q7_DECLARE_QUERY)
+#define Q7_DECLARE_SUMMARY_QUERY(name, Row, keys, overTime) Q7_DECLARE_QUERY(name)
+  // Current-status rows: the current interval's over-time rows without aggby.
+#define Q7_DECLARE_CURRENT_QUERY(name, overTime, COLUMNS) \
+  kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count);
+  Q7_ANALYZER_TABLES(Q7_DECLARE_OVER_TIME_QUERY, Q7_DECLARE_SUMMARY_QUERY, Q7_DECLARE_CURRENT_QUERY,
+                     Q7_DECLARE_QUERY)
+#undef Q7_DECLARE_CURRENT_QUERY
+#undef Q7_DECLARE_SUMMARY_QUERY
 #undef Q7_DECLARE_QUERY
 #undef Q7_DECLARE_OVER_TIME_QUERY
-  // Current-status rows: the current interval's over-time rows without aggby.
-  kq7_q7appcs_data_t* get_tblappcs(int sampleType, int* count);
-  kq7_q7txcs_data_t* get_tbltxcs(int sampleType, int* count);
-  kq7_q7clntcs_data_t* get_tblclntcs(int sampleType, int* count);
-  kq7_q7srvcs_data_t* get_tblsrvcs(int sampleType, int* count);
 
   // The registered patterns as pattern-table rows, in matching order (pattern_rows.cc). Only
   // sample type 3 yields rows; new[] arrays as above. Any thread.

@@ -66,13 +66,11 @@ constexpr TableOps Ops(const char* stem) {
   return {stem, &SaveTree<Row>, &LoadTree<Row>, &SeedTree<Row>};
 }
 
-// In OverTimeTable order.
+// In OverTimeTable order: the list's.
+#define Q7_TREE_OPS(name, Row, keys, Tree, EXPORT) Ops<Row>("q7" #name),
 constexpr TableOps kTables[kOverTimeTables] = {
-    Ops<CApplicationOverTime>("q7appot"),   Ops<CServerAppOverTime>("q7srvappot"),
-    Ops<CServerOverTime>("q7srvot"),        Ops<CClientServerOverTime>("q7clntsrvot"),
-    Ops<CClientOverTime>("q7clntot"),       Ops<CTransactionOverTime>("q7txot"),
-    Ops<CClientAppOverTime>("q7clntappot"), Ops<CSubTransactionOverTime>("q7subtxot"),
-};
+    Q7_ANALYZER_TABLES(Q7_TREE_OPS, Q7_NO_SUMMARY, Q7_NO_CURRENT, Q7_NO_INSTANCE)};
+#undef Q7_TREE_OPS
 
 void Collect(AVLTree& tree, TreeNode* node, std::vector<TreeNode*>& nodes) {
   if (node == nullptr) {

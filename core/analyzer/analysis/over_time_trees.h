@@ -9,25 +9,25 @@
 #include <memory>
 #include <vector>
 
+#include "core/analyzer/rows/analyzer_tables.h"
 #include "core/runtime/ts_avl_tree.h"
 
 namespace history {
 class HistoryStore;
 }
 
-// The over-time tables, in the order transaction processing updates a page's tables, then the
-// sub-transaction table. Also the index into COverTimeTrees.
+// The over-time tables in their list's order (rows/analyzer_tables.h): the order transaction
+// processing updates a page's tables, then the sub-transaction table. Also the index into
+// COverTimeTrees.
+#define Q7_TREE_ENUMERATOR(name, Row, keys, Tree, EXPORT) Tree,
 enum class OverTimeTable : int {
-  kApplication,
-  kServerApp,
-  kServer,
-  kClientServer,
-  kClient,
-  kTransaction,
-  kClientApp,
-  kSubTransaction,
+  Q7_ANALYZER_TABLES(Q7_TREE_ENUMERATOR, Q7_NO_SUMMARY, Q7_NO_CURRENT, Q7_NO_INSTANCE)
 };
-inline constexpr int kOverTimeTables = 8;
+#undef Q7_TREE_ENUMERATOR
+#define Q7_COUNT_TREE(name, Row, keys, Tree, EXPORT) +1
+inline constexpr int kOverTimeTables =
+    0 Q7_ANALYZER_TABLES(Q7_COUNT_TREE, Q7_NO_SUMMARY, Q7_NO_CURRENT, Q7_NO_INSTANCE);
+#undef Q7_COUNT_TREE
 
 // History file stem of each table ("q7appot" ...).
 const char* overTimeStem(OverTimeTable table);

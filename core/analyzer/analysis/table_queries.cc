@@ -44,14 +44,11 @@ void StampSampleTime(Layout* rows, int count, time_t now) {
 
 }  // namespace
 
-#define Q7_DEFINE_CONVERSION(ot, cs, COLUMNS)                                                \
+#define Q7_DEFINE_CONVERSION(cs, ot, COLUMNS)                                                \
   void q7_convert_##ot##_to_##cs(const kq7_q7##ot##_data_t& from, kq7_q7##cs##_data_t& to) { \
     COLUMNS(Q7_COPY_COLUMN)                                                                  \
   }
-Q7_DEFINE_CONVERSION(appot, appcs, Q7_COLS_APPCS)
-Q7_DEFINE_CONVERSION(txot, txcs, Q7_COLS_TXCS)
-Q7_DEFINE_CONVERSION(clntot, clntcs, Q7_COLS_CLNTCS)
-Q7_DEFINE_CONVERSION(srvot, srvcs, Q7_COLS_SRVCS)
+Q7_ANALYZER_TABLES(Q7_NO_OVER_TIME, Q7_NO_SUMMARY, Q7_DEFINE_CONVERSION, Q7_NO_INSTANCE)
 #undef Q7_DEFINE_CONVERSION
 #undef Q7_COPY_COLUMN
 
@@ -195,42 +192,28 @@ Layout* CDPXAnalyzer::lockedQuery(Inner inner, int* count) {
         count);                                                                    \
   }
 
-// An over-time table and the summary folded from it: the over-time name, tree and row class,
-// then the summary name and row class.
-#define Q7_OVER_TIME_AND_SUMMARY(ot, table, OverTimeRow, sm, SummaryRow)                           \
+// An over-time table: its tree and row class; and a summary: its row class, folded from the
+// over-time query of its over-time table.
+#define Q7_OVER_TIME(ot, OverTimeRow, keys, Tree, EXPORT)                                          \
   kq7_q7##ot##_data_t* CDPXAnalyzer::i_get_tbl##ot(int sampleType, int* count, bool currentOnly) { \
-    return overTimeQuery<OverTimeRow>(OverTimeTable::table, "i_get_tbl" #ot, sampleType, count,    \
+    return overTimeQuery<OverTimeRow>(OverTimeTable::Tree, "i_get_tbl" #ot, sampleType, count,     \
                                       currentOnly);                                                \
   }                                                                                                \
-  kq7_q7##sm##_data_t* CDPXAnalyzer::i_get_tbl##sm(int sampleType, int* count) {                   \
-    return summaryQuery<SummaryRow>(&CDPXAnalyzer::i_get_tbl##ot, "i_get_tbl" #sm, sampleType,     \
-                                    count);                                                        \
-  }                                                                                                \
-  Q7_LOCKED_QUERY(ot, false)                                                                       \
+  Q7_LOCKED_QUERY(ot, false)
+#define Q7_SUMMARY(sm, SummaryRow, keys, ot)                                                   \
+  kq7_q7##sm##_data_t* CDPXAnalyzer::i_get_tbl##sm(int sampleType, int* count) {               \
+    return summaryQuery<SummaryRow>(&CDPXAnalyzer::i_get_tbl##ot, "i_get_tbl" #sm, sampleType, \
+                                    count);                                                    \
+  }                                                                                            \
   Q7_LOCKED_QUERY(sm)
-Q7_OVER_TIME_AND_SUMMARY(appot, kApplication, CApplicationOverTime, appsm, CApplicationSummary)
-Q7_OVER_TIME_AND_SUMMARY(clntappot, kClientApp, CClientAppOverTime, clntapp, CClientAppSummary)
-Q7_OVER_TIME_AND_SUMMARY(clntot, kClient, CClientOverTime, clntsm, CClientSummary)
-Q7_OVER_TIME_AND_SUMMARY(clntsrvot, kClientServer, CClientServerOverTime, clntsrv,
-                         CClientServerSummary)
-Q7_OVER_TIME_AND_SUMMARY(srvappot, kServerApp, CServerAppOverTime, srvappsm, CServerAppSummary)
-Q7_OVER_TIME_AND_SUMMARY(srvot, kServer, CServerOverTime, srvsm, CServerSummary)
-Q7_OVER_TIME_AND_SUMMARY(txot, kTransaction, CTransactionOverTime, txsm, CTransactionSummary)
-Q7_OVER_TIME_AND_SUMMARY(subtxot, kSubTransaction, CSubTransactionOverTime, subtxsm,
-                         CSubTransactionSummary)
-#undef Q7_OVER_TIME_AND_SUMMARY
 
 #define Q7_INSTANCE(name)                                                                          \
   kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count) {               \
     return instanceQuery<kq7_q7##name##_data_t>("q7" #name, "i_get_tbl" #name, sampleType, count); \
   }                                                                                                \
   Q7_LOCKED_QUERY(name)
-Q7_INSTANCE(txins)
-Q7_INSTANCE(subtxins)
-#undef Q7_INSTANCE
-#undef Q7_LOCKED_QUERY
 
-#define Q7_CURRENT_STATUS(cs, ot)                                              \
+#define Q7_CURRENT_STATUS(cs, ot, COLUMNS)                                     \
   kq7_q7##cs##_data_t* CDPXAnalyzer::get_tbl##cs(int sampleType, int* count) { \
     CLOG::enter(2, "%s(%d,--)", "get_tbl" #cs, sampleType);                    \
     const time_t now = fw::Now();                                              \
@@ -254,8 +237,9 @@ Q7_INSTANCE(subtxins)
     CLOG::exit(2, "%s(%d,%d)", "get_tbl" #cs, sampleType, *count);             \
     return rows;                                                               \
   }
-Q7_CURRENT_STATUS(appcs, appot)
-Q7_CURRENT_STATUS(txcs, txot)
-Q7_CURRENT_STATUS(clntcs, clntot)
-Q7_CURRENT_STATUS(srvcs, srvot)
+Q7_ANALYZER_TABLES(Q7_OVER_TIME, Q7_SUMMARY, Q7_CURRENT_STATUS, Q7_INSTANCE)
 #undef Q7_CURRENT_STATUS
+#undef Q7_INSTANCE
+#undef Q7_SUMMARY
+#undef Q7_OVER_TIME
+#undef Q7_LOCKED_QUERY

@@ -10,6 +10,7 @@
 //
 // Threads and ownership as CBaseTable: rows live in the analyzer's trees, which own them.
 
+#include "core/analyzer/rows/analyzer_tables.h"
 #include "core/analyzer/rows/keyed_row.h"
 
 namespace rows {
@@ -46,28 +47,13 @@ inline constexpr KeySpec<2> kServerKeys{{K::kServer, K::kServerIP}, {0, 1}};
     using rows::TSummaryRow<keys, overTime, layout>::TSummaryRow;       \
   };
 
-Q7_OVER_TIME_ROW(CApplicationOverTime, rows::kApplicationKeys, kq7_q7appot_data_t)
-Q7_OVER_TIME_ROW(CClientAppOverTime, rows::kClientAppOverTimeKeys, kq7_q7clntappot_data_t)
-Q7_OVER_TIME_ROW(CServerAppOverTime, rows::kServerAppOverTimeKeys, kq7_q7srvappot_data_t)
-Q7_OVER_TIME_ROW(CTransactionOverTime, rows::kTransactionOverTimeKeys, kq7_q7txot_data_t)
-Q7_OVER_TIME_ROW(CSubTransactionOverTime, rows::kSubTransactionKeys, kq7_q7subtxot_data_t)
-Q7_OVER_TIME_ROW(CClientOverTime, rows::kClientKeys, kq7_q7clntot_data_t)
-Q7_OVER_TIME_ROW(CClientServerOverTime, rows::kClientServerKeys, kq7_q7clntsrvot_data_t)
-Q7_OVER_TIME_ROW(CServerOverTime, rows::kServerKeys, kq7_q7srvot_data_t)
-
-Q7_SUMMARY_ROW(CApplicationSummary, rows::kApplicationKeys, kq7_q7appot_data_t, kq7_q7appsm_data_t)
-Q7_SUMMARY_ROW(CClientAppSummary, rows::kClientAppSummaryKeys, kq7_q7clntappot_data_t,
-               kq7_q7clntapp_data_t)
-Q7_SUMMARY_ROW(CServerAppSummary, rows::kServerAppSummaryKeys, kq7_q7srvappot_data_t,
-               kq7_q7srvappsm_data_t)
-Q7_SUMMARY_ROW(CTransactionSummary, rows::kTransactionSummaryKeys, kq7_q7txot_data_t,
-               kq7_q7txsm_data_t)
-Q7_SUMMARY_ROW(CSubTransactionSummary, rows::kSubTransactionKeys, kq7_q7subtxot_data_t,
-               kq7_q7subtxsm_data_t)
-Q7_SUMMARY_ROW(CClientSummary, rows::kClientKeys, kq7_q7clntot_data_t, kq7_q7clntsm_data_t)
-Q7_SUMMARY_ROW(CClientServerSummary, rows::kClientServerKeys, kq7_q7clntsrvot_data_t,
-               kq7_q7clntsrv_data_t)
-Q7_SUMMARY_ROW(CServerSummary, rows::kServerKeys, kq7_q7srvot_data_t, kq7_q7srvsm_data_t)
+#define Q7_OVER_TIME_ROW_ENTRY(name, Row, keys, Tree, EXPORT) \
+  Q7_OVER_TIME_ROW(Row, keys, kq7_q7##name##_data_t)
+#define Q7_SUMMARY_ROW_ENTRY(name, Row, keys, overTime) \
+  Q7_SUMMARY_ROW(Row, keys, kq7_q7##overTime##_data_t, kq7_q7##name##_data_t)
+Q7_ANALYZER_TABLES(Q7_OVER_TIME_ROW_ENTRY, Q7_SUMMARY_ROW_ENTRY, Q7_NO_CURRENT, Q7_NO_INSTANCE)
+#undef Q7_SUMMARY_ROW_ENTRY
+#undef Q7_OVER_TIME_ROW_ENTRY
 
 #undef Q7_SUMMARY_ROW
 #undef Q7_OVER_TIME_ROW
