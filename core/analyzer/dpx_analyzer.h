@@ -124,17 +124,6 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   void selectTreesFor(long t) REQUIRES(treeMutex);
   void recordInstance(CDPXTransaction& w, bool page, const InstancePatterns& names)
       REQUIRES(treeMutex);
-  template <class OverTimeRow>
-  typename OverTimeRow::LayoutType* overTimeQuery(OverTimeTable table, const char* where,
-                                                  int sampleType, int* count, bool currentOnly)
-      REQUIRES(treeMutex);
-  template <class SummaryRow>
-  typename SummaryRow::LayoutType* summaryQuery(
-      typename SummaryRow::OverTimeLayoutType* (CDPXAnalyzer::*inner)(int, int*, bool),
-      const char* where, int sampleType, int* count) REQUIRES(treeMutex);
-  template <class Layout>
-  Layout* instanceQuery(const char* stem, const char* where, int sampleType, int* count)
-      REQUIRES(treeMutex);
   template <class Layout, class Inner>
   Layout* lockedQuery(Inner inner, int* count) EXCLUDES(treeMutex);
   void saveIntervalData(long interval) REQUIRES(treeMutex);

@@ -83,10 +83,6 @@ void Collect(AVLTree& tree, TreeNode* node, std::vector<TreeNode*>& nodes) {
 
 }  // namespace
 
-const char* overTimeStem(OverTimeTable table) {
-  return kTables[static_cast<int>(table)].stem;
-}
-
 void getTreeNodes(AVLTree& tree, std::vector<TreeNode*>& nodes) {
   const size_t before = nodes.size();
   nodes.reserve(before + static_cast<size_t>(tree.getSize()));

@@ -29,8 +29,6 @@ inline constexpr int kOverTimeTables =
     0 Q7_ANALYZER_TABLES(Q7_COUNT_TREE, Q7_NO_SUMMARY, Q7_NO_CURRENT, Q7_NO_INSTANCE);
 #undef Q7_COUNT_TREE
 
-// History file stem of each table ("q7appot" ...).
-const char* overTimeStem(OverTimeTable table);
 
 class COverTimeTrees {
  public:

@@ -10,6 +10,7 @@
 #include "core/analyzer/rows/rows.h"
 #include "core/config/cconfig.h"
 #include "core/history/history_store.h"
+#include "core/history/instance_file.h"
 #include "core/runtime/clog.h"
 #include "framework/clock.h"
 
@@ -56,10 +57,22 @@ int CDPXAnalyzer::summaryIntervals() {
   return CConfig::getSummaryInterval() * 60 / CConfig::getOverTimeInterval();
 }
 
+namespace {
+
+// The summary period's history before the current interval, as the queries read it.
+struct HistoryWindow {
+  history::HistoryStore& store;
+  long interval;  // start of the current interval
+  long length;    // seconds in an interval
+  int intervals;  // intervals in the summary period
+};
+
+// A query of over-time rows: tree's rows (the current interval's), then, unless currentOnly,
+// the history of stem before the current interval.
 template <class OverTimeRow>
-typename OverTimeRow::LayoutType* CDPXAnalyzer::overTimeQuery(OverTimeTable table,
-                                                              const char* where, int sampleType,
-                                                              int* count, bool currentOnly) {
+typename OverTimeRow::LayoutType* OverTimeRows(TSAVLTree& tree, const char* stem,
+                                               const HistoryWindow& history, const char* where,
+                                               int sampleType, int* count, bool currentOnly) {
   using Layout = typename OverTimeRow::LayoutType;
   CLOG::enter(2, "%s(%d,--,%d)", where, sampleType, currentOnly ? 1 : 0);
   *count = 0;
@@ -67,14 +80,11 @@ typename OverTimeRow::LayoutType* CDPXAnalyzer::overTimeQuery(OverTimeTable tabl
     CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
     return nullptr;
   }
-  const long interval = getCurrentOverTimeInterval();
-  const long length = IntervalSeconds();
-  const char* stem = overTimeStem(table);
-  const size_t historyRows =
-      currentOnly ? 0
-                  : Capped(history->countRows(stem, interval - length, summaryIntervals(), length,
-                                              sizeof(Layout)));
-  TSAVLTree& tree = cache->currentIntervalTrees().tree(table);
+  const long from = history.interval - history.length;
+  const size_t historyRows = currentOnly
+                                 ? 0
+                                 : Capped(history.store.countRows(stem, from, history.intervals,
+                                                                  history.length, sizeof(Layout)));
   const size_t current = static_cast<size_t>(tree.getSize());
   if (historyRows + current == 0) {
     CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
@@ -88,25 +98,23 @@ typename OverTimeRow::LayoutType* CDPXAnalyzer::overTimeQuery(OverTimeTable tabl
   }
   size_t loaded = 0;
   if (historyRows > 0) {
-    loaded = history->loadRows(stem, interval - length, summaryIntervals(), length, sizeof(Layout),
-                               historyRows, rows.get() + current);
+    loaded = history.store.loadRows(stem, from, history.intervals, history.length, sizeof(Layout),
+                                    historyRows, rows.get() + current);
   }
   *count = static_cast<int>(current + loaded);
   CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
   return rows.release();
 }
 
+// The second half of a summary query: the over-time rows (overTimeCount of them, the caller's
+// query) folded by the summary's key. The caller has traced the entry.
 template <class SummaryRow>
-typename SummaryRow::LayoutType* CDPXAnalyzer::summaryQuery(
-    typename SummaryRow::OverTimeLayoutType* (CDPXAnalyzer::*inner)(int, int*, bool),
+typename SummaryRow::LayoutType* FoldSummary(
+    std::unique_ptr<typename SummaryRow::OverTimeLayoutType[]> overTime, int overTimeCount,
     const char* where, int sampleType, int* count) {
   using Layout = typename SummaryRow::LayoutType;
-  using OverTimeLayout = typename SummaryRow::OverTimeLayoutType;
-  CLOG::enter(2, "%s(%d,--)", where, sampleType);
   *count = 0;
   TSAVLTree folded(0, false);
-  int overTimeCount = 0;
-  std::unique_ptr<OverTimeLayout[]> overTime((this->*inner)(sampleType, &overTimeCount, false));
   if (overTime && overTimeCount > 0) {
     CLOG::max("%s, current data present.", where);
     for (int i = 0; i < overTimeCount; ++i) {
@@ -139,31 +147,34 @@ typename SummaryRow::LayoutType* CDPXAnalyzer::summaryQuery(
   return rows;
 }
 
+// A query of instance rows: the instance files (flushed first) of stem over the summary
+// period, the current interval's included.
 template <class Layout>
-Layout* CDPXAnalyzer::instanceQuery(const char* stem, const char* where, int sampleType,
-                                    int* count) {
+Layout* InstanceRows(const char* stem, history::InstanceFile& pages, history::InstanceFile& objects,
+                     const HistoryWindow& history, const char* where, int sampleType, int* count) {
   CLOG::enter(2, "%s(%d,--)", where, sampleType);
   *count = 0;
   if (sampleType != 3) {
     CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
     return nullptr;
   }
-  flushInstanceFile();
-  flushSubInstanceFile();
-  const long interval = getCurrentOverTimeInterval();
-  const long length = IntervalSeconds();
-  const size_t records =
-      Capped(history->countRows(stem, interval, summaryIntervals(), length, sizeof(Layout)));
+  pages.flush();
+  objects.flush();
+  const size_t records = Capped(history.store.countRows(stem, history.interval, history.intervals,
+                                                        history.length, sizeof(Layout)));
   if (records < 1) {
     CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
     return nullptr;
   }
   auto rows = std::make_unique<Layout[]>(records);
-  *count = static_cast<int>(history->loadRows(stem, interval, summaryIntervals(), length,
-                                              sizeof(Layout), records, rows.get()));
+  *count =
+      static_cast<int>(history.store.loadRows(stem, history.interval, history.intervals,
+                                              history.length, sizeof(Layout), records, rows.get()));
   CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
   return rows.release();
 }
+
+}  // namespace
 
 template <class Layout, class Inner>
 Layout* CDPXAnalyzer::lockedQuery(Inner inner, int* count) {
@@ -194,23 +205,36 @@ Layout* CDPXAnalyzer::lockedQuery(Inner inner, int* count) {
 
 // An over-time table: its tree and row class; and a summary: its row class, folded from the
 // over-time query of its over-time table.
+// The window of history the queries read.
+#define Q7_HISTORY_WINDOW                                                         \
+  HistoryWindow {                                                                 \
+    *history, getCurrentOverTimeInterval(), IntervalSeconds(), summaryIntervals() \
+  }
+// An over-time table: its tree and row class; a summary: its row class, folded from the
+// over-time query of its over-time table; instance rows from the instance files.
 #define Q7_OVER_TIME(ot, OverTimeRow, keys, Tree, EXPORT)                                          \
   kq7_q7##ot##_data_t* CDPXAnalyzer::i_get_tbl##ot(int sampleType, int* count, bool currentOnly) { \
-    return overTimeQuery<OverTimeRow>(OverTimeTable::Tree, "i_get_tbl" #ot, sampleType, count,     \
-                                      currentOnly);                                                \
+    return OverTimeRows<OverTimeRow>(cache->currentIntervalTrees().tree(OverTimeTable::Tree),      \
+                                     "q7" #ot, Q7_HISTORY_WINDOW, "i_get_tbl" #ot, sampleType,     \
+                                     count, currentOnly);                                          \
   }                                                                                                \
   Q7_LOCKED_QUERY(ot, false)
-#define Q7_SUMMARY(sm, SummaryRow, keys, ot)                                                   \
-  kq7_q7##sm##_data_t* CDPXAnalyzer::i_get_tbl##sm(int sampleType, int* count) {               \
-    return summaryQuery<SummaryRow>(&CDPXAnalyzer::i_get_tbl##ot, "i_get_tbl" #sm, sampleType, \
-                                    count);                                                    \
-  }                                                                                            \
+#define Q7_SUMMARY(sm, SummaryRow, keys, ot)                                            \
+  kq7_q7##sm##_data_t* CDPXAnalyzer::i_get_tbl##sm(int sampleType, int* count) {        \
+    CLOG::enter(2, "%s(%d,--)", "i_get_tbl" #sm, sampleType);                           \
+    int overTimeCount = 0;                                                              \
+    std::unique_ptr<kq7_q7##ot##_data_t[]> overTime(                                    \
+        i_get_tbl##ot(sampleType, &overTimeCount, false));                              \
+    return FoldSummary<SummaryRow>(std::move(overTime), overTimeCount, "i_get_tbl" #sm, \
+                                   sampleType, count);                                  \
+  }                                                                                     \
   Q7_LOCKED_QUERY(sm)
-
-#define Q7_INSTANCE(name)                                                                          \
-  kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count) {               \
-    return instanceQuery<kq7_q7##name##_data_t>("q7" #name, "i_get_tbl" #name, sampleType, count); \
-  }                                                                                                \
+#define Q7_INSTANCE(name)                                                                        \
+  kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count) {             \
+    return InstanceRows<kq7_q7##name##_data_t>("q7" #name, *instanceFile, *subInstanceFile,      \
+                                               Q7_HISTORY_WINDOW, "i_get_tbl" #name, sampleType, \
+                                               count);                                           \
+  }                                                                                              \
   Q7_LOCKED_QUERY(name)
 
 #define Q7_CURRENT_STATUS(cs, ot, COLUMNS)                                     \
@@ -243,3 +267,4 @@ Q7_ANALYZER_TABLES(Q7_OVER_TIME, Q7_SUMMARY, Q7_CURRENT_STATUS, Q7_INSTANCE)
 #undef Q7_SUMMARY
 #undef Q7_OVER_TIME
 #undef Q7_LOCKED_QUERY
+#undef Q7_HISTORY_WINDOW
