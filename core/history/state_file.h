@@ -24,9 +24,6 @@ class StateFile {
   // path: the state file; nothing is read until load().
   explicit StateFile(std::string path);
 
-  StateFile(const StateFile&) = delete;
-  StateFile& operator=(const StateFile&) = delete;
-
   // Replaces what is held with the file's contents. A missing file reads as empty; a line with
   // an unreadable time is skipped and traced. False, traced, when the file cannot be read.
   bool load();

@@ -74,16 +74,21 @@ extern const SM3_RECORD_TAGS SM3_RECORD_KINDS[4];
   int32_t iRequestBytes;           \
   int32_t iReplyBytes;
 
+// The request's description, fields 23 to 28 of a page line and 24 to 29 of an audio or video
+// line: the same fields, at different offsets.
+#define SM3_REQUEST_FIELDS        \
+  char szURL[255];                \
+  char szReferrerURL[255];        \
+  char szBrowserDescription[255]; \
+  char szServerDescription[255];  \
+  char szApplicationProtocol[33]; \
+  int32_t iRequestStatus;
+
 // A page line (record types 1 and 2), the 46 fields in line order. Text slots keep at most
 // width - 1 characters. Trans date and Trans time string are skipped by the parser and stay empty.
 struct SM3_HPAGE_ENTRY {
   SM3_SHARED_ENTRY_FIELDS
-  char szURL[255];
-  char szReferrerURL[255];
-  char szBrowserDescription[255];
-  char szServerDescription[255];
-  char szApplicationProtocol[33];
-  int32_t iRequestStatus;
+  SM3_REQUEST_FIELDS
   int32_t iServerTime;   // ms
   int32_t iResolveTime;  // ms
   int32_t iLoadTime;     // ms
@@ -109,15 +114,11 @@ struct SM3_HPAGE_ENTRY {
 struct _SM3_AV_ENTRY {
   SM3_SHARED_ENTRY_FIELDS
   int32_t iObjectValue1;  // kept here only; not carried into a page entry
-  char szURL[255];
-  char szReferrerURL[255];
-  char szBrowserDescription[255];
-  char szServerDescription[255];
-  char szApplicationProtocol[33];
-  int32_t iRequestStatus;
+  SM3_REQUEST_FIELDS
   int32_t iObjectValue2;  // kept here only; not carried into a page entry
   int32_t iNetworkTime;   // ms; read from the line's first character only
 };
+#undef SM3_REQUEST_FIELDS
 #undef SM3_SHARED_ENTRY_FIELDS
 
 // The shared leading fields must sit at the same offsets, so they convert as one block.
