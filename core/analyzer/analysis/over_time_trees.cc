@@ -21,7 +21,8 @@ bool SaveTree(TSAVLTree& tree, history::HistoryStore& store, long interval, cons
 }
 
 template <class Row>
-void LoadTree(TSAVLTree& tree, history::HistoryStore& store, long interval, const char* stem) {
+void LoadTree(COverTimeTrees& trees, OverTimeTable table, history::HistoryStore& store,
+              long interval, const char* stem) {
   using Layout = typename Row::LayoutType;
   const std::vector<std::byte> bytes = store.loadInterval(interval, stem, sizeof(Layout));
   const size_t count = bytes.size() / sizeof(Layout);
@@ -29,7 +30,7 @@ void LoadTree(TSAVLTree& tree, history::HistoryStore& store, long interval, cons
     Layout layout;
     memcpy(&layout, bytes.data() + i * sizeof(Layout), sizeof(Layout));
     auto row = std::make_unique<Row>(layout);
-    if (tree.addNode(row.get())) {
+    if (trees.add(table, row.get(), row->indexHash())) {
       row.release();  // the tree owns it now
     } else {
       CLOG::min("%s duplicate row in the history of %s for interval[%ld] ignored",
@@ -39,7 +40,7 @@ void LoadTree(TSAVLTree& tree, history::HistoryStore& store, long interval, cons
 }
 
 template <class Row>
-void SeedTree(TSAVLTree& tree, TSAVLTree& ended, long interval) {
+void SeedTree(COverTimeTrees& trees, OverTimeTable table, TSAVLTree& ended, long interval) {
   using Layout = typename Row::LayoutType;
   std::vector<TreeNode*> nodes;
   getTreeNodes(ended, nodes);
@@ -48,7 +49,7 @@ void SeedTree(TSAVLTree& tree, TSAVLTree& ended, long interval) {
     static_cast<Row*>(node)->getQ7Struct(layout);
     auto row = std::make_unique<Row>(layout);
     row->reset(interval);
-    if (tree.addNode(row.get())) {
+    if (trees.add(table, row.get(), row->indexHash())) {
       row.release();
     }
   }
@@ -57,8 +58,8 @@ void SeedTree(TSAVLTree& tree, TSAVLTree& ended, long interval) {
 struct TableOps {
   const char* stem;
   bool (*save)(TSAVLTree&, history::HistoryStore&, long, const char*);
-  void (*load)(TSAVLTree&, history::HistoryStore&, long, const char*);
-  void (*seed)(TSAVLTree&, TSAVLTree&, long);
+  void (*load)(COverTimeTrees&, OverTimeTable, history::HistoryStore&, long, const char*);
+  void (*seed)(COverTimeTrees&, OverTimeTable, TSAVLTree&, long);
 };
 
 template <class Row>
@@ -118,12 +119,31 @@ bool COverTimeTrees::save(history::HistoryStore& store, long interval) const {
 
 void COverTimeTrees::load(history::HistoryStore& store, long interval) {
   for (int i = 0; i < kOverTimeTables; ++i) {
-    kTables[i].load(*trees_[i], store, interval, kTables[i].stem);
+    kTables[i].load(*this, static_cast<OverTimeTable>(i), store, interval, kTables[i].stem);
   }
 }
 
 void COverTimeTrees::seedZeroRows(const COverTimeTrees& ended, long interval) {
   for (int i = 0; i < kOverTimeTables; ++i) {
-    kTables[i].seed(*trees_[i], *ended.trees_[i], interval);
+    kTables[i].seed(*this, static_cast<OverTimeTable>(i), *ended.trees_[i], interval);
   }
+}
+
+TreeNode* COverTimeTrees::find(OverTimeTable table, std::size_t hash, TreeNode& probe) const {
+  const auto [first, last] = index_[static_cast<int>(table)].equal_range(hash);
+  for (auto it = first; it != last; ++it) {
+    if (it->second->equals(probe, 0)) {
+      return it->second;
+    }
+  }
+  return nullptr;
+}
+
+bool COverTimeTrees::add(OverTimeTable table, TreeNode* row, std::size_t hash) {
+  const int i = static_cast<int>(table);
+  if (!trees_[i]->addNode(row)) {
+    return false;
+  }
+  index_[i].emplace(hash, row);
+  return true;
 }

@@ -6,7 +6,9 @@
 //
 // The trees own their rows. Threads: the analyzer's tree lock guards a set and its rows.
 
+#include <cstddef>
 #include <memory>
+#include <unordered_map>
 #include <vector>
 
 #include "core/analyzer/rows/analyzer_tables.h"
@@ -29,7 +31,6 @@ inline constexpr int kOverTimeTables =
     0 Q7_ANALYZER_TABLES(Q7_COUNT_TREE, Q7_NO_SUMMARY, Q7_NO_CURRENT, Q7_NO_INSTANCE);
 #undef Q7_COUNT_TREE
 
-
 class COverTimeTrees {
  public:
   COverTimeTrees();
@@ -37,6 +38,12 @@ class COverTimeTrees {
   COverTimeTrees& operator=(const COverTimeTrees&) = delete;
 
   TSAVLTree& tree(OverTimeTable table) { return *trees_[static_cast<int>(table)]; }
+  // The row of table equal to probe, whose key hashes to hash (TKeyedRow::indexHash), or null:
+  // a hash lookup in front of the tree, which stays the ordered store and the rows' owner.
+  TreeNode* find(OverTimeTable table, std::size_t hash, TreeNode& probe) const;
+  // Adds row (whose key hashes to hash) to table's tree and index; false when the tree refused
+  // it (the caller keeps it).
+  bool add(OverTimeTable table, TreeNode* row, std::size_t hash);
   const TSAVLTree& tree(OverTimeTable table) const { return *trees_[static_cast<int>(table)]; }
   long totalRows() const;
 
@@ -50,6 +57,7 @@ class COverTimeTrees {
 
  private:
   std::unique_ptr<TSAVLTree> trees_[kOverTimeTables];
+  std::unordered_multimap<std::size_t, TreeNode*> index_[kOverTimeTables];  // owned by trees_
 };
 
 // Every object of tree in its order (left to right), for copying rows out.

@@ -26,17 +26,19 @@ constexpr int kAggByApplication = 1;
 constexpr int kAggByClient = 2;
 constexpr int kAggByTransaction = 4;
 
-// Builds the row of Row for w, finds its equal in tree, or adds a new one starting at the
-// transaction's interval; then adds w to it.
+// Builds the row of Row for w, finds its equal in table (through the trees' index), or adds a
+// new one starting at the transaction's interval; then adds w to it.
 template <class Row>
-void UpdateTable(TSAVLTree& tree, CDPXTransaction& w, const char* refusal) {
+void UpdateTable(COverTimeTrees& trees, OverTimeTable table, CDPXTransaction& w,
+                 const char* refusal) {
   Row key(w);
   key.setDeleteOnRemoval(false);  // a lookup key: the tree must not destroy it
-  Row* row = static_cast<Row*>(tree.findNode(&key));
+  const std::size_t hash = key.indexHash();
+  Row* row = static_cast<Row*>(trees.find(table, hash, key));
   if (row == nullptr) {
     auto fresh = std::make_unique<Row>(w);
     fresh->reset(w.getTimeRecorded());
-    if (!tree.addNode(fresh.get())) {
+    if (!trees.add(table, fresh.get(), hash)) {
       CLOG::min("%s", refusal);
       return;
     }
@@ -47,17 +49,17 @@ void UpdateTable(TSAVLTree& tree, CDPXTransaction& w, const char* refusal) {
 
 // The seven page tables, in this order.
 void UpdatePageTables(COverTimeTrees& trees, CDPXTransaction& w) {
-  UpdateTable<CApplicationOverTime>(trees.tree(OverTimeTable::kApplication), w,
+  UpdateTable<CApplicationOverTime>(trees, OverTimeTable::kApplication, w,
                                     "Error adding to AOT tree!");
-  UpdateTable<CServerAppOverTime>(trees.tree(OverTimeTable::kServerApp), w,
+  UpdateTable<CServerAppOverTime>(trees, OverTimeTable::kServerApp, w,
                                   "Error adding to CSAOT tree!");
-  UpdateTable<CServerOverTime>(trees.tree(OverTimeTable::kServer), w, "Error adding to CSOT tree!");
-  UpdateTable<CClientServerOverTime>(trees.tree(OverTimeTable::kClientServer), w,
+  UpdateTable<CServerOverTime>(trees, OverTimeTable::kServer, w, "Error adding to CSOT tree!");
+  UpdateTable<CClientServerOverTime>(trees, OverTimeTable::kClientServer, w,
                                      "Error adding to CCSOT tree!");
-  UpdateTable<CClientOverTime>(trees.tree(OverTimeTable::kClient), w, "Error adding to CCOT tree!");
-  UpdateTable<CTransactionOverTime>(trees.tree(OverTimeTable::kTransaction), w,
+  UpdateTable<CClientOverTime>(trees, OverTimeTable::kClient, w, "Error adding to CCOT tree!");
+  UpdateTable<CTransactionOverTime>(trees, OverTimeTable::kTransaction, w,
                                     "Error adding to CTOT tree!");
-  UpdateTable<CClientAppOverTime>(trees.tree(OverTimeTable::kClientApp), w,
+  UpdateTable<CClientAppOverTime>(trees, OverTimeTable::kClientApp, w,
                                   "Error adding to CAOT tree!");
 }
 
@@ -291,9 +293,8 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
             recordInstance(w, page, names);
           }
           if (!page) {
-            UpdateTable<CSubTransactionOverTime>(
-                cache->trees().tree(OverTimeTable::kSubTransaction), w,
-                "Error adding to CSTOT tree!");
+            UpdateTable<CSubTransactionOverTime>(cache->trees(), OverTimeTable::kSubTransaction, w,
+                                                 "Error adding to CSTOT tree!");
           }
         }
         elapsed = QbrmBestGetCurrentTime() - started;

@@ -13,7 +13,9 @@
 #include <cstdint>
 #include <cstdio>
 #include <cstring>
+#include <functional>
 #include <string>
+#include <string_view>
 
 #include "core/analyzer/intake/dpx_transaction.h"
 #include "core/analyzer/rows/base_table.h"
@@ -189,6 +191,17 @@ class TKeyedRow : public CBaseTable {
     return buffer;
   }
 
+  // A hash of the key: equal for two rows when equals() holds (each field counts up to its
+  // first NUL or its width).
+  std::size_t indexHash() const {
+    std::size_t h = 0;
+    for (std::size_t i = 0; i < kKeys; ++i) {
+      const std::string_view field(key(i), strnlen(key(i), KeyWidth(kSpec.fields[i])));
+      h = h * 1000003u ^ std::hash<std::string_view>{}(field);
+    }
+    return h;
+  }
+
   // The key field in storage position i, KeyWidth bytes, NUL-padded, unterminated when full.
   const char* key(std::size_t i) const { return keys_ + kOffsets.at[i]; }
   const Carried& carried() const { return carried_; }
@@ -313,7 +326,9 @@ class TKeyedRow : public CBaseTable {
 
   static const char* OriginNode();
 
-  char* keyAt(std::size_t i) { return keys_ + kOffsets.at[i]; }
+  char* keyAt(std::size_t i) {
+    return keys_ + kOffsets.at[i];
+  }
 
   // Both constructors write every key byte, so the keys need no clearing first: rows are built
   // for every lookup on the per-transaction path.
