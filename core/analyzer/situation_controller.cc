@@ -305,6 +305,7 @@ bool CSituationController::add(std::unique_ptr<Pattern>&& pattern, PatternFile& 
     entries->insert(before, std::move(entry));
     count = entries->size();
     image = Image(*entries);
+    reindex(*entries);
   }
   CLOG::med("%s: situation %s: %s pattern [%s] [%s] placed %zu of %zu", kWhere, added.situationId,
             K::kNoun, K::first(added), K::second(added), at + 1, count);
@@ -372,6 +373,7 @@ int CSituationController::remove(const char* situationId, PatternFile& file,
     });
     if (removed > 0) {
       image = Image(*entries);
+      reindex(*entries);
     }
   }
   if (removed > 0) {
@@ -408,6 +410,34 @@ void AppendMatch(Node*** tail, const Pattern& pattern, const char* where, const 
 
 }  // namespace
 
+template <typename Pattern, typename Visit>
+void CSituationController::forEachMatch(std::vector<Entry<Pattern>>& entries, PatternIndex& index,
+                                        const char* first, const char* second, Visit visit) {
+  using K = Kind<Pattern>;
+  if (index.size() != entries.size() || !index.candidates(first, second, &candidates_)) {
+    for (Entry<Pattern>& e : entries) {  // a text that is not ASCII: every pattern in order
+      if (CCommon::patternMatches(K::first(*e.pattern), first, e.first.get()) &&
+          CCommon::patternMatches(K::second(*e.pattern), second, e.second.get()) &&
+          !visit(*e.pattern)) {
+        return;
+      }
+    }
+    return;
+  }
+  const std::string& a = index.foldedFirst();
+  const std::string& b = index.foldedSecond();
+  for (const uint32_t i : candidates_) {
+    Entry<Pattern>& e = entries[i];
+    if (CCommon::patternMatchesFolded(K::first(*e.pattern), first, a.data(), a.size(),
+                                      e.first.get()) &&
+        CCommon::patternMatchesFolded(K::second(*e.pattern), second, b.data(), b.size(),
+                                      e.second.get()) &&
+        !visit(*e.pattern)) {
+      return;
+    }
+  }
+}
+
 TransactionMatch* CSituationController::matchTransactionPatterns(const char* applicationName,
                                                                  const char* transactionName,
                                                                  bool all, bool sample) {
@@ -417,30 +447,26 @@ TransactionMatch* CSituationController::matchTransactionPatterns(const char* app
   TransactionMatch* head = nullptr;
   TransactionMatch** tail = &head;
   CvelMutexLock lock(mutex_);
-  for (Entry<TransactionPattern>& e : transactions_) {
-    TransactionPattern& p = *e.pattern;
-    if (!CCommon::patternMatches(p.applicationPattern, applicationName, e.first.get()) ||
-        !CCommon::patternMatches(p.transactionPattern, transactionName, e.second.get())) {
-      continue;
-    }
-    ++p.matchedCount;
-    bool taken = !sample;
-    if (sample && p.samplePercent > 0) {
-      // Single precision on purpose: which matches are taken must not drift from the counts
-      // operators already know (50 % takes the 2nd, 4th, ...).
-      const float step = 100.0f / static_cast<float>(p.samplePercent);
-      if (step <= static_cast<float>(p.matchedCount) - static_cast<float>(p.sampledCount) * step) {
-        ++p.sampledCount;
-        taken = true;
-      }
-    }
-    if (taken) {
-      AppendMatch(&tail, p, "CSituationController::matchTransactionPatterns", p.transactionPattern);
-    }
-    if (!all) {
-      break;
-    }
-  }
+  forEachMatch(transactions_, transactionIndex_, applicationName, transactionName,
+               [&](TransactionPattern& p) {
+                 ++p.matchedCount;
+                 bool taken = !sample;
+                 if (sample && p.samplePercent > 0) {
+                   // Single precision on purpose: which matches are taken must not drift from
+                   // the counts operators already know (50 % takes the 2nd, 4th, ...).
+                   const float step = 100.0f / static_cast<float>(p.samplePercent);
+                   if (step <= static_cast<float>(p.matchedCount) -
+                                   static_cast<float>(p.sampledCount) * step) {
+                     ++p.sampledCount;
+                     taken = true;
+                   }
+                 }
+                 if (taken) {
+                   AppendMatch(&tail, p, "CSituationController::matchTransactionPatterns",
+                               p.transactionPattern);
+                 }
+                 return all;
+               });
   return head;
 }
 
@@ -452,17 +478,10 @@ ClientMatch* CSituationController::matchClientPatterns(const char* clientName,
   ClientMatch* head = nullptr;
   ClientMatch** tail = &head;
   CvelMutexLock lock(mutex_);
-  for (const Entry<ClientPattern>& e : clients_) {
-    const ClientPattern& p = *e.pattern;
-    if (!CCommon::patternMatches(p.hostNamePattern, clientName, e.first.get()) ||
-        !CCommon::patternMatches(p.ipAddressPattern, clientIPAddress, e.second.get())) {
-      continue;
-    }
+  forEachMatch(clients_, clientIndex_, clientName, clientIPAddress, [&](const ClientPattern& p) {
     AppendMatch(&tail, p, "CSituationController::matchClientPatterns", p.hostNamePattern);
-    if (!all) {
-      break;
-    }
-  }
+    return all;
+  });
   return head;
 }
 
@@ -528,6 +547,17 @@ void CSituationController::write(PatternFile& file, const std::string& image) {
 }
 
 template <typename Pattern>
+void CSituationController::reindex(const std::vector<Entry<Pattern>>& entries) {
+  using K = Kind<Pattern>;
+  std::vector<std::pair<PatternIndex::Field, PatternIndex::Field>> pairs;
+  pairs.reserve(entries.size());
+  for (const Entry<Pattern>& e : entries) {
+    pairs.push_back({{K::first(*e.pattern), e.first.get()}, {K::second(*e.pattern), e.second.get()}});
+  }
+  indexOf(entries).build(pairs);
+}
+
+template <typename Pattern>
 bool CSituationController::reload(PatternFile& file, std::vector<Entry<Pattern>>* entries) {
   using K = Kind<Pattern>;
   static constexpr const char* kWhere = "CSituationController::loadPatternsIfNewer";
@@ -556,6 +586,7 @@ bool CSituationController::reload(PatternFile& file, std::vector<Entry<Pattern>>
   CLOG::min("%s: %s: %zu %s patterns", kWhere, file.path.c_str(), loaded.size(), K::kNoun);
   CvelMutexLock lock(mutex_);
   entries->swap(loaded);  // the old patterns go when loaded does, after the lock
+  reindex(*entries);
   return true;
 }
 

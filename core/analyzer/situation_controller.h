@@ -27,6 +27,7 @@
 #include <vector>
 
 #include "core/analyzer/intake/common.h"
+#include "core/analyzer/intake/pattern_index.h"
 #include "core/runtime/cvel_mutex.h"
 
 // Text field widths in bytes, the terminating NUL included. Texts are UTF-8.
@@ -203,6 +204,21 @@ class CSituationController {
   // Replaces entries with the file's patterns when it changed; true when it did.
   template <typename Pattern>
   bool reload(PatternFile& file, std::vector<Entry<Pattern>>* entries);
+  // Rebuilds the index of entries (transactions_ or clients_) after it changed.
+  template <typename Pattern>
+  void reindex(const std::vector<Entry<Pattern>>& entries) REQUIRES(mutex_);
+  PatternIndex& indexOf(const std::vector<Entry<TransactionPattern>>&) REQUIRES(mutex_) {
+    return transactionIndex_;
+  }
+  PatternIndex& indexOf(const std::vector<Entry<ClientPattern>>&) REQUIRES(mutex_) {
+    return clientIndex_;
+  }
+  // Calls visit(pattern) for each entry whose two patterns match first and second, in order,
+  // until visit returns false. Candidates come from index; texts it cannot index are matched
+  // against every entry.
+  template <typename Pattern, typename Visit>
+  void forEachMatch(std::vector<Entry<Pattern>>& entries, PatternIndex& index, const char* first,
+                    const char* second, Visit visit) REQUIRES(mutex_);
   // Replaces file's contents with image and remembers its modification time.
   void write(PatternFile& file, const std::string& image) REQUIRES(file.mutex);
 
@@ -214,4 +230,7 @@ class CSituationController {
   mutable CvelMutex mutex_;
   std::vector<Entry<TransactionPattern>> transactions_ GUARDED_BY(mutex_);  // matching order
   std::vector<Entry<ClientPattern>> clients_ GUARDED_BY(mutex_);            // insertion order
+  PatternIndex transactionIndex_ GUARDED_BY(mutex_);  // over transactions_
+  PatternIndex clientIndex_ GUARDED_BY(mutex_);       // over clients_
+  std::vector<uint32_t> candidates_ GUARDED_BY(mutex_);  // matching's scratch
 };

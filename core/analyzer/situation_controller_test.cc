@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <ctime>
 #include <filesystem>
@@ -107,6 +108,76 @@ TEST_F(SituationControllerTest, SamplingTakesTheShareAskedFor) {
 }
 
 // The walk stops at the first pattern that matches even when sampling passes it over.
+// The index in front of matching must find what the literal ordered scan finds: random patterns
+// over a small alphabet (so that prefixes, suffixes and fixed texts collide), with case, '*' in
+// every position and characters ICU folds onto ASCII (the Kelvin sign, long s), against random
+// names, including ones that are not ASCII; and again after removals and a reload.
+TEST_F(SituationControllerTest, IndexedMatchingAgreesWithTheOrderedScan) {
+  const std::vector<std::string> patternParts = {"a", "A", "b", "ab", "/", ".", "*", "*",
+                                                 "\xe2\x84\xaa", "\xc5\xbf", "k", "s"};
+  const std::vector<std::string> textParts = {"a", "B", "b", "/", ".", "k", "K", "s", "\xc3\xa9"};
+  std::srand(19);
+  const auto random = [](const std::vector<std::string>& parts, int most) {
+    std::string text;
+    for (int n = std::rand() % (most + 1); n > 0; --n) {
+      text += parts[static_cast<size_t>(std::rand()) % parts.size()];
+    }
+    return text;
+  };
+  for (int i = 0; i < 150; ++i) {
+    const std::string id = "s" + std::to_string(i % 40);
+    const std::string app = random(patternParts, 4);
+    const std::string tx = random(patternParts, 5);
+    controller_->addTransactionPattern(Tx(id.c_str(), app.empty() ? "*" : app.c_str(), tx.c_str()));
+    controller_->addClientPattern(Client(id.c_str(), app.c_str(), tx.c_str()));
+  }
+  const auto expect = [](const auto& patterns, const char* first, const char* second, bool all,
+                         auto firstOf, auto secondOf) {
+    std::string ids;
+    for (const auto& p : patterns) {
+      if (CCommon::patternMatches(firstOf(p), first) &&
+          CCommon::patternMatches(secondOf(p), second)) {
+        ids += std::string(ids.empty() ? "" : ",") + p.situationId;
+        if (!all) {
+          break;
+        }
+      }
+    }
+    return ids;
+  };
+  const auto check = [&](const CSituationController& c, int rounds) {
+    const std::vector<TransactionPattern> txs = c.getTransactionPatterns();
+    const std::vector<ClientPattern> clients = c.getClientPatterns();
+    ASSERT_FALSE(txs.empty());
+    for (int r = 0; r < rounds; ++r) {
+      const std::string a = random(textParts, 4);
+      const std::string b = random(textParts, 6);
+      for (const bool all : {false, true}) {
+        ASSERT_EQ(expect(txs, a.c_str(), b.c_str(), all,
+                         [](const TransactionPattern& p) { return p.applicationPattern; },
+                         [](const TransactionPattern& p) { return p.transactionPattern; }),
+                  Match(a.c_str(), b.c_str(), all, false))
+            << "[" << a << "] [" << b << "] all=" << all;
+        ASSERT_EQ(expect(clients, a.c_str(), b.c_str(), all,
+                         [](const ClientPattern& p) { return p.hostNamePattern; },
+                         [](const ClientPattern& p) { return p.ipAddressPattern; }),
+                  MatchClient(a.c_str(), b.c_str(), all))
+            << "[" << a << "] [" << b << "] all=" << all;
+      }
+    }
+  };
+  check(*controller_, 1500);
+  for (int i = 0; i < 40; i += 3) {
+    controller_->removeTransactionPatterns(("s" + std::to_string(i)).c_str());
+    controller_->removeClientPatterns(("s" + std::to_string(i)).c_str());
+  }
+  check(*controller_, 600);
+  // A reload replaces the patterns the index was built over.
+  controller_ = std::make_unique<CSituationController>(dir_);
+  controller_->loadPatternsIfNewer();
+  check(*controller_, 600);
+}
+
 TEST_F(SituationControllerTest, FirstMatchOnlyStopsAtAnUntakenMatch) {
   controller_->addTransactionPattern(Tx("half", "*", "/shop/*", 50));
   controller_->addTransactionPattern(Tx("all", "*", "*"));

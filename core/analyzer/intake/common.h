@@ -7,6 +7,8 @@
 // Thread safety: every function may be called from any thread on data the caller owns; a
 // _PARSE_INFO list may be shared by concurrent matchers.
 
+#include <cstddef>
+
 #include "core/analyzer/intake/file_info.h"
 #include "core/analyzer/intake/parse_info.h"
 
@@ -68,6 +70,15 @@ class CCommon {
   // and freed on the spot. Texts are read as UTF-8.
   static bool patternMatches(const char* pattern, const char* text, const _PARSE_INFO* list);
   static bool patternMatches(const char* pattern, const char* text);
+  // The same answer for a text the caller already folded: folded holds foldAscii of text
+  // (n bytes), so a caller matching one text against many patterns folds it once. text must be
+  // ASCII; it is still read when a pattern has non-ASCII parts.
+  static bool patternMatchesFolded(const char* pattern, const char* text, const char* folded,
+                                   size_t n, const _PARSE_INFO* list);
+  // Folds n bytes of ASCII text as ICU's default case folding does (A-Z to a-z) into dest, which
+  // takes n + 1 bytes (a NUL ends it). False when the text holds a byte above 0x7f; dest is then
+  // filled but meaningless.
+  static bool foldAscii(const char* text, size_t n, char* dest);
 
   // ---- Found-file lists. ----
 

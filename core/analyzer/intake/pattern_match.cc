@@ -159,11 +159,8 @@ bool matchIcu(const _PARSE_INFO* list, const char* text) {
 
 }  // namespace pattern_internal
 
-namespace {
-
-// Folds an ASCII text into dest (n + 1 bytes); false when the text holds a non-ASCII byte. One
-// pass without early exit, so the compiler can vectorise it.
-bool foldAscii(const char* text, size_t n, char* dest) {
+// One pass without early exit, so the compiler can vectorise it.
+bool CCommon::foldAscii(const char* text, size_t n, char* dest) {
   unsigned char seen = 0;
   for (size_t i = 0; i < n; ++i) {
     const unsigned char c = static_cast<unsigned char>(text[i]);
@@ -174,12 +171,18 @@ bool foldAscii(const char* text, size_t n, char* dest) {
   return seen < 0x80;
 }
 
-bool matchList(const _PARSE_INFO* list, const char* text) {
-  bool asciiPattern = true;
-  for (const _PARSE_INFO* e = list; e != nullptr && asciiPattern; e = e->next) {
-    asciiPattern = e->asciiFolded != nullptr;
+namespace {
+
+bool asciiList(const _PARSE_INFO* list) {
+  bool ascii = true;
+  for (const _PARSE_INFO* e = list; e != nullptr && ascii; e = e->next) {
+    ascii = e->asciiFolded != nullptr;
   }
-  if (asciiPattern) {
+  return ascii;
+}
+
+bool matchList(const _PARSE_INFO* list, const char* text) {
+  if (asciiList(list)) {
     const size_t n = strlen(text);
     char small[512];
     std::string large;
@@ -188,7 +191,7 @@ bool matchList(const _PARSE_INFO* list, const char* text) {
       large.resize(n + 1);
       buffer = large.data();
     }
-    if (foldAscii(text, n, buffer)) {
+    if (CCommon::foldAscii(text, n, buffer)) {
       return matchAscii(list, buffer, n);
     }
   }
@@ -273,4 +276,15 @@ bool CCommon::patternMatches(const char* pattern, const char* text, const _PARSE
 
 bool CCommon::patternMatches(const char* pattern, const char* text) {
   return patternMatches(pattern, text, nullptr);
+}
+
+bool CCommon::patternMatchesFolded(const char* pattern, const char* text, const char* folded,
+                                   size_t n, const _PARSE_INFO* list) {
+  if (pattern == nullptr || text == nullptr || list == nullptr) {
+    return patternMatches(pattern, text, list);
+  }
+  if (pattern[0] == '*' && pattern[1] == '\0') {
+    return true;
+  }
+  return asciiList(list) ? matchAscii(list, folded, n) : pattern_internal::matchIcu(list, text);
 }
