@@ -5,7 +5,11 @@
 // same file with cat, the CPU each of the two threads used, and then the latency of a summary
 // and an over-time sample of the transaction table.
 //
-// Usage: bench_q7bench [--records N]
+// How cost grows: --patterns N adds per-site and per-path transaction patterns up to N in all
+// (longer than the operator's ten, so they come first in matching order), and --keys N gives
+// every record one of N URLs, so the trees hold that many distinct transaction keys and more.
+//
+// Usage: bench_q7bench [--records N] [--patterns N] [--keys N]
 
 #include <dirent.h>
 #include <stdlib.h>
@@ -47,7 +51,7 @@ double Seconds(Clock::time_point from, Clock::time_point to) {
 
 // Writes the records with sm3gen in a child process: its ground truth (a map of every URL)
 // would otherwise count in this process's peak resident memory.
-bool Generate(const std::string& path, int64_t records, int64_t start) {
+bool Generate(const std::string& path, int64_t records, int64_t start, int64_t keys) {
   const pid_t child = fork();
   if (child == 0) {
     sm3gen::FileJob job;
@@ -57,6 +61,7 @@ bool Generate(const std::string& path, int64_t records, int64_t start) {
     job.model.start = start;
     job.model.rate = kRate;
     job.model.sites = 8;  // every site of the catalog, so each site pattern sees traffic
+    job.model.url_keys = keys;
     std::string error;
     const bool ok = sm3gen::RunFileMode(job, &error);
     if (!ok) {
@@ -99,6 +104,60 @@ void AddPatterns(CDPXAnalyzer& analyzer) {
   analyzer.newClientPattern("office", "Head office", "*", "10.1.*", 2);
   analyzer.newClientPattern("branches", "Branches", "*", "10.20.*", 2);
   analyzer.newClientPattern("home", "Home workers", "*", "192.168.*", 0);
+}
+
+// Patterns that a site with many applications would add: per-site ones for hosts that are not
+// in the traffic, per-path ones for hosts that are (which the shop's and the news site's pages
+// must be tried against), with leading, inner and trailing wildcards and lengths from 20 to 60.
+void AddScalingPatterns(CDPXAnalyzer& analyzer, int total) {
+  static const char* const kWords[] = {"catalog", "account", "search",  "img",   "static",
+                                       "orders",  "profile", "reports", "admin", "export"};
+  for (int i = 0; total - i > 10; ++i) {
+    const std::string word = kWords[i % 10];
+    const std::string n = std::to_string(i);
+    std::string app;
+    std::string tx;
+    switch (i % 6) {
+      case 0:
+        app = "www.site" + n + ".example.net";
+        tx = "/" + word + "/*";
+        break;
+      case 1:
+        app = "*.site" + n + ".example.net";
+        tx = "*/" + word + "/*.jsp";
+        break;
+      case 2:
+        app = "api" + n + ".example.net";
+        tx = "/api/v" + std::to_string(i % 3) + "/" + word + "*";
+        break;
+      case 3:
+        app = "www.shop.example";
+        tx = "/shop/" + word + n + "/*";
+        break;
+      case 4:
+        app = "news.example.org";
+        tx = "/articles/" + n + "/*" + word + "*.html";
+        break;
+      default:
+        app = "*" + word + n + ".example.com";
+        tx = "*/" + word + "/*";
+        break;
+    }
+    const std::string id = "scale" + n;
+    if (!analyzer.newTransactionPattern(id.c_str(), ("App" + n).c_str(), app.c_str(),
+                                        ("Tx" + n).c_str(), tx.c_str(), 0, 0, 0, 100, 2000, 50)) {
+      std::fprintf(stderr, "transaction pattern %s refused\n", id.c_str());
+    }
+  }
+}
+
+// Resident memory now, in bytes.
+long long ResidentBytes() {
+  std::ifstream statm("/proc/self/statm");
+  long long pages = 0;
+  long long resident = 0;
+  statm >> pages >> resident;
+  return resident * sysconf(_SC_PAGESIZE);
 }
 
 // CPU seconds of this process's threads by name, as last seen. Read while the threads run,
@@ -155,16 +214,22 @@ double CatSeconds(const std::string& file) {
 
 int main(int argc, char** argv) {
   int64_t records = 1000000;
+  int patterns = 10;
+  int64_t keys = 0;
   for (int i = 1; i < argc; ++i) {
     if (std::strcmp(argv[i], "--records") == 0 && i + 1 < argc) {
       records = std::atoll(argv[++i]);
+    } else if (std::strcmp(argv[i], "--patterns") == 0 && i + 1 < argc) {
+      patterns = std::atoi(argv[++i]);
+    } else if (std::strcmp(argv[i], "--keys") == 0 && i + 1 < argc) {
+      keys = std::atoll(argv[++i]);
     } else {
-      std::fprintf(stderr, "usage: %s [--records N]\n", argv[0]);
+      std::fprintf(stderr, "usage: %s [--records N] [--patterns N] [--keys N]\n", argv[0]);
       return 2;
     }
   }
-  if (records <= 0) {
-    std::fprintf(stderr, "--records must be positive\n");
+  if (records <= 0 || patterns < 10 || keys < 0) {
+    std::fprintf(stderr, "--records must be positive, --patterns at least 10, --keys >= 0\n");
     return 2;
   }
 
@@ -191,7 +256,7 @@ int main(int argc, char** argv) {
   }
   // Stamped a few seconds back, never before the interval's start.
   const std::string file = std::string(CConfig::getDpxDataDirectory()) + "/traffic.sm3";
-  if (!Generate(file, records, std::max(now - 5, now - now % interval))) {
+  if (!Generate(file, records, std::max(now - 5, now - now % interval), keys)) {
     std::fprintf(stderr, "cannot write %s\n", file.c_str());
     std::filesystem::remove_all(dir);
     return 1;
@@ -201,6 +266,8 @@ int main(int argc, char** argv) {
   // No data directory: the one monitor below is the only reader, as the bench measures it.
   CDPXAnalyzer analyzer({CConfig::getDpxOdiDataDirectory(), dir + "/q7state.properties", ""});
   AddPatterns(analyzer);
+  AddScalingPatterns(analyzer, patterns);
+  const long long residentBefore = ResidentBytes();
   analyzer.Start();
 
   CDPXDataFileMonitor monitor(file.c_str(), 0);
@@ -263,7 +330,15 @@ int main(int argc, char** argv) {
   }
   std::printf("throughput: %.0f transactions/s, %.2f us per transaction (%.2f s)\n", done / seconds,
               seconds * 1e6 / done, seconds);
-  std::printf("peak resident memory: %.1f MiB\n", usage.ru_maxrss / 1024.0);
+  long rows = 0;
+  analyzer.visitTrees([&rows](const COverTimeTrees& trees) { rows = trees.totalRows(); });
+  std::printf("patterns: %d transaction, 3 client; URLs: %s\n", patterns,
+              keys > 0 ? std::to_string(keys).c_str() : "the model's");
+  std::printf("peak resident memory: %.1f MiB; rows held %ld, %.0f bytes per row above the %.1f "
+              "MiB at start\n",
+              usage.ru_maxrss / 1024.0, rows,
+              rows > 0 ? (usage.ru_maxrss * 1024.0 - residentBefore) / rows : 0.0,
+              residentBefore / 1048576.0);
   std::printf("floor (cat, warm cache): %.0f MB/s, %.0f records/s\n", fileBytes / 1e6 / catSeconds,
               records / catSeconds);
   std::printf(

@@ -220,6 +220,13 @@ Record TrafficModel::Next() {
   }
   Record record = std::move(pending_.front());
   pending_.pop_front();
+  if (options_.url_keys > 0) {
+    // An odd multiplier not divisible by 5 is a bijection modulo every 2^a 5^b.
+    const uint64_t key =
+        static_cast<uint64_t>(sequence_) * 2654435761u % static_cast<uint64_t>(options_.url_keys);
+    record.url = fmt::format("/key/{}", key);
+    SplitUrl(&record);
+  }
   Stamp(&record);
   return record;
 }

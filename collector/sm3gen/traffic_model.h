@@ -31,6 +31,9 @@ struct ModelOptions {
   double objects = 6;      // mean embedded objects per ordinary page (APIs have none)
   double av_share = 3;     // percent of embedded objects that are audio or video
   double error_share = 5;  // percent of records answered with a 4xx, 5xx or odd status
+  // > 0: every record's URL becomes "/key/<k>" with k taken in a fixed scrambled order from
+  // 0..url_keys-1, so the first url_keys records have distinct URLs (benchmarks of key counts).
+  int64_t url_keys = 0;
 };
 
 inline constexpr int kMaxSites = 200;

@@ -139,6 +139,18 @@ TEST(sm3genModel, ValuesFitTheirFieldsAndCoverTheCases) {
               query);
 }
 
+// A key count gives exactly that many URLs over its first that many records, then repeats.
+TEST(sm3genModel, UrlKeysCycleThroughDistinctUrls) {
+  ModelOptions options = Options();
+  options.url_keys = 1000;
+  std::set<std::string> urls;
+  for (const Record& r : Take(options, 1500)) {
+    urls.insert(r.url_path + r.url_file);
+    EXPECT_EQ("/key/", r.url_path);
+  }
+  EXPECT_EQ(1000u, urls.size());
+}
+
 TEST(sm3genModel, ZeroSharesSwitchFeaturesOff) {
   ModelOptions options = Options();
   options.error_share = 0;
