@@ -61,6 +61,14 @@ int CreateTemp(std::string* temp, bool unique) {
 
 int ReplaceFile(const std::string& path, std::string_view contents, const ReplaceOptions& options,
                 ReplaceResult* result, std::string* error) {
+  return ReplaceFileInPieces(
+      path, [contents](const ContentSink& sink) { return sink(contents); }, options, result,
+      error);
+}
+
+int ReplaceFileInPieces(const std::string& path,
+                        const std::function<bool(const ContentSink&)>& produce,
+                        const ReplaceOptions& options, ReplaceResult* result, std::string* error) {
   ReplaceResult local;
   ReplaceResult& r = result != nullptr ? *result : local;
   r = ReplaceResult{};
@@ -87,12 +95,14 @@ int ReplaceFile(const std::string& path, std::string_view contents, const Replac
   // Without the fsync before the rename, a power cut could leave the new name pointing at
   // blocks that were never written. The time is taken before the rename, which keeps it, so a
   // later write by someone else is never mistaken for this one.
-  bool written = ::fchmod(fd, options.mode) == 0 && WriteAll(fd, contents) && ::fsync(fd) == 0 &&
-                 ::fstat(fd, &st) == 0;
+  errno = 0;
+  bool written = ::fchmod(fd, options.mode) == 0 &&
+                 produce([fd](std::string_view piece) { return WriteAll(fd, piece); }) &&
+                 ::fsync(fd) == 0 && ::fstat(fd, &st) == 0;
   const int saved = errno;
   written = ::close(fd) == 0 && written;
   if (!written) {
-    errno = saved != 0 ? saved : errno;
+    errno = saved != 0 ? saved : (errno != 0 ? errno : EIO);
     return fail(ReplaceStep::kWrite);
   }
   r.modified = st.st_mtim;

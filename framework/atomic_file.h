@@ -18,6 +18,7 @@
 #include <sys/types.h>
 #include <time.h>
 
+#include <functional>
 #include <string>
 #include <string_view>
 
@@ -45,5 +46,15 @@ struct ReplaceResult {
 int ReplaceFile(const std::string& path, std::string_view contents,
                 const ReplaceOptions& options = {}, ReplaceResult* result = nullptr,
                 std::string* error = nullptr);
+
+// Hands each piece of new contents to the file; false when the write failed (errno set).
+using ContentSink = std::function<bool(std::string_view piece)>;
+
+// The same replacement with contents produced in pieces, so that a large file never has to be
+// held whole in memory: produce(sink) calls sink for each piece in order and returns false when
+// a piece could not be written (or it could not make one; errno then says why).
+int ReplaceFileInPieces(const std::string& path, const std::function<bool(const ContentSink&)>& produce,
+                        const ReplaceOptions& options = {}, ReplaceResult* result = nullptr,
+                        std::string* error = nullptr);
 
 }  // namespace fw

@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
+#include <cerrno>
 #include <filesystem>
 #include <string>
 
@@ -42,6 +43,32 @@ TEST(AtomicFileTest, ReplacesWholeWithModeAndLeavesNothingBehind) {
   ASSERT_EQ(kOk, ReplaceFile(path, "", {0644, dir.file("deep/er/.list.tmp")}));
   EXPECT_EQ("", dir.read("deep/er/list.json"));
   EXPECT_EQ(1u, EntriesIn(dir.file("deep/er")));
+}
+
+// Contents in pieces arrive in order; a producer that fails part-way (a full disk) leaves the
+// old file whole and no temporary file.
+TEST(AtomicFileTest, PiecesInOrderAndAFailedPieceKeepsTheOldFile) {
+  q7test::ScratchDir dir;
+  const std::string path = dir.file("data");
+  ASSERT_EQ(kOk, ReplaceFileInPieces(path, [](const ContentSink& sink) {
+              return sink("one,") && sink("") && sink("two");
+            }));
+  EXPECT_EQ("one,two", dir.read("data"));
+  ReplaceResult result;
+  EXPECT_EQ(kIoError, ReplaceFileInPieces(
+                          path,
+                          [](const ContentSink& sink) {
+                            if (!sink("half")) {
+                              return false;
+                            }
+                            errno = ENOSPC;
+                            return false;
+                          },
+                          {}, &result));
+  EXPECT_EQ(ReplaceStep::kWrite, result.failed);
+  EXPECT_EQ(ENOSPC, result.error_number);
+  EXPECT_EQ("one,two", dir.read("data"));
+  EXPECT_EQ(1u, EntriesIn(dir.path()));
 }
 
 TEST(AtomicFileTest, FailureLeavesTheOldFileAndNamesTheStep) {

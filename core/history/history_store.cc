@@ -10,6 +10,7 @@
 #include <optional>
 #include <system_error>
 #include <utility>
+#include <vector>
 
 #include "core/history/history_file_name.h"
 #include "core/runtime/clog.h"
@@ -98,6 +99,16 @@ std::string HistoryStore::pathOf(int64_t interval, std::string_view stem) const 
 
 bool HistoryStore::saveInterval(int64_t interval, std::string_view stem, const void* records,
                                 size_t record_size, size_t count) const {
+  return saveIntervalInPieces(interval, stem, record_size, count,
+                              [records, record_size](size_t first, size_t n, void* out) {
+                                memcpy(out, static_cast<const char*>(records) + first * record_size,
+                                       n * record_size);
+                              });
+}
+
+bool HistoryStore::saveIntervalInPieces(int64_t interval, std::string_view stem,
+                                        size_t record_size, size_t count,
+                                        const RecordFill& fill) const {
   static const char* const kWhere = "HistoryStore::saveInterval";
   if (interval < 0) {
     CLOG::error("%s negative interval start %lld for %.*s", kWhere,
@@ -115,8 +126,19 @@ bool HistoryStore::saveInterval(int64_t interval, std::string_view stem, const v
   // A fixed temporary name, so that cleanup recognises what a crash left behind.
   fw::ReplaceOptions options;
   options.temp_path = directory_ + "/" + TemporaryFileName(interval, stem);
-  const std::string_view bytes(static_cast<const char*>(records), record_size * count);
-  if (fw::ReplaceFile(path, bytes, options) != fw::kOk) {
+  const auto produce = [&](const fw::ContentSink& sink) {
+    std::vector<char> piece(record_size * std::min(count, kPieceRecords));
+    for (size_t first = 0; first < count; first += kPieceRecords) {
+      const size_t n = std::min(kPieceRecords, count - first);
+      std::fill(piece.begin(), piece.end(), 0);  // padding and unset columns write as zeros
+      fill(first, n, piece.data());
+      if (!sink(std::string_view(piece.data(), n * record_size))) {
+        return false;
+      }
+    }
+    return true;
+  };
+  if (fw::ReplaceFileInPieces(path, produce, options) != fw::kOk) {
     CLOG::error("%s cannot write %s: %s", kWhere, path.c_str(), std::strerror(errno));
     return false;
   }

@@ -19,6 +19,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -45,6 +46,13 @@ class HistoryStore {
   // written; the previous contents then stay in place.
   bool saveInterval(int64_t interval, std::string_view stem, const void* records,
                     size_t record_size, size_t count) const;
+  // The same with the records made a stretch at a time, so a large interval is never copied
+  // whole: fill(first, n, out) writes records first..first+n-1 (n at most kPieceRecords) to out,
+  // which it finds zeroed.
+  static constexpr size_t kPieceRecords = 1024;
+  using RecordFill = std::function<void(size_t first, size_t n, void* out)>;
+  bool saveIntervalInPieces(int64_t interval, std::string_view stem, size_t record_size,
+                            size_t count, const RecordFill& fill) const;
 
   // Whole records in the files of the `intervals` interval starts last_interval,
   // last_interval - interval_seconds, ... (starts below 0 are skipped).

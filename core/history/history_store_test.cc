@@ -89,6 +89,33 @@ TEST_F(HistoryStoreTest, SaveReplacesAndEmptySaveRemoves) {
   EXPECT_TRUE(store_.loadInterval(kT, "q7txot", sizeof(Record)).empty());
 }
 
+// Records made a stretch at a time write the same file as one buffer, across piece boundaries;
+// each stretch starts zeroed, so columns a row leaves unset read as zero.
+TEST_F(HistoryStoreTest, SavingInPiecesWritesTheSameFile) {
+  const size_t count = HistoryStore::kPieceRecords * 2 + 7;
+  std::vector<Record> records(count);
+  for (size_t i = 0; i < count; ++i) {
+    records[i] = {kT, static_cast<int32_t>(i), 0};
+  }
+  ASSERT_TRUE(store_.saveInterval(kT, "q7txot", records.data(), sizeof(Record), count));
+  const std::vector<std::byte> whole = store_.loadInterval(kT, "q7txot", sizeof(Record));
+  size_t next = 0;
+  ASSERT_TRUE(store_.saveIntervalInPieces(
+      kT + kStep, "q7txot", sizeof(Record), count, [&](size_t first, size_t n, void* out) {
+        EXPECT_EQ(next, first);
+        EXPECT_LE(n, HistoryStore::kPieceRecords);
+        next = first + n;
+        auto* rows = static_cast<Record*>(out);
+        for (size_t i = 0; i < n; ++i) {
+          EXPECT_EQ(0, rows[i].pad);
+          rows[i].interval = kT;
+          rows[i].id = static_cast<int32_t>(first + i);
+        }
+      }));
+  EXPECT_EQ(count, next);
+  EXPECT_TRUE(whole == store_.loadInterval(kT + kStep, "q7txot", sizeof(Record)));
+}
+
 // Counting and loading walk back from the last interval, skip gaps, stop at the window and cap.
 TEST_F(HistoryStoreTest, CountAndLoadSeveralIntervalsNewestFirst) {
   save(kT + kStep, 90, 5);  // after the window
