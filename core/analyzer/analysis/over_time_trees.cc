@@ -13,11 +13,14 @@ bool SaveTree(TSAVLTree& tree, history::HistoryStore& store, long interval, cons
   using Layout = typename Row::LayoutType;
   std::vector<TreeNode*> nodes;
   getTreeNodes(tree, nodes);
-  std::vector<Layout> rows(nodes.size());
-  for (size_t i = 0; i < nodes.size(); ++i) {
-    static_cast<Row*>(nodes[i])->getQ7Struct(rows[i]);
-  }
-  return store.saveInterval(interval, stem, rows.data(), sizeof(Layout), rows.size());
+  // A stretch of rows at a time: a copy of the whole tree would double the peak memory.
+  return store.saveIntervalInPieces(
+      interval, stem, sizeof(Layout), nodes.size(), [&nodes](size_t first, size_t n, void* out) {
+        Layout* const rows = static_cast<Layout*>(out);
+        for (size_t i = 0; i < n; ++i) {
+          static_cast<Row*>(nodes[first + i])->getQ7Struct(rows[i]);
+        }
+      });
 }
 
 template <class Row>
@@ -130,13 +133,8 @@ void COverTimeTrees::seedZeroRows(const COverTimeTrees& ended, long interval) {
 }
 
 TreeNode* COverTimeTrees::find(OverTimeTable table, std::size_t hash, TreeNode& probe) const {
-  const auto [first, last] = index_[static_cast<int>(table)].equal_range(hash);
-  for (auto it = first; it != last; ++it) {
-    if (it->second->equals(probe, 0)) {
-      return it->second;
-    }
-  }
-  return nullptr;
+  return index_[static_cast<int>(table)].find(
+      hash, [&probe](TreeNode* row) { return row->equals(probe, 0); });
 }
 
 bool COverTimeTrees::add(OverTimeTable table, TreeNode* row, std::size_t hash) {
@@ -144,6 +142,15 @@ bool COverTimeTrees::add(OverTimeTable table, TreeNode* row, std::size_t hash) {
   if (!trees_[i]->addNode(row)) {
     return false;
   }
-  index_[i].emplace(hash, row);
+  if (!index_[i].add(hash, row)) {
+    // Without its index entry the row could never be found again: take it back out.
+    // The caller keeps a refused row, so the tree must not destroy it on the way out.
+    CLOG::error("%s: out of memory indexing a row; row refused", "COverTimeTrees::add");
+    const bool deleteOnRemoval = row->getDeleteOnRemoval();
+    row->setDeleteOnRemoval(false);
+    trees_[i]->removeNode(row, true);
+    row->setDeleteOnRemoval(deleteOnRemoval);
+    return false;
+  }
   return true;
 }

@@ -8,9 +8,9 @@
 
 #include <cstddef>
 #include <memory>
-#include <unordered_map>
 #include <vector>
 
+#include "core/analyzer/analysis/row_index.h"
 #include "core/analyzer/rows/analyzer_tables.h"
 #include "core/runtime/ts_avl_tree.h"
 
@@ -57,7 +57,7 @@ class COverTimeTrees {
 
  private:
   std::unique_ptr<TSAVLTree> trees_[kOverTimeTables];
-  std::unordered_multimap<std::size_t, TreeNode*> index_[kOverTimeTables];  // owned by trees_
+  RowIndex index_[kOverTimeTables];  // over trees_'s rows
 };
 
 // Every object of tree in its order (left to right), for copying rows out.
