@@ -1,5 +1,7 @@
 #include "framework/clock.h"
 
+#include <time.h>
+
 #include <atomic>
 #include <chrono>
 #include <cstdio>
@@ -51,6 +53,20 @@ void SetClockForTesting(std::function<time_t()> clock) {
 }  // namespace fw
 
 void TimeSince70ToMordel(time_t t, char* out) {
+  // Every row an interval creates stamps its start, and instance rows stamp seconds that
+  // repeat: the last answer is kept per thread, keyed also by the zone tzset last set (which
+  // is all localtime_r follows).
+  thread_local struct {
+    bool valid = false;
+    time_t t = 0;
+    long zone = 0;
+    int daylight = 0;
+    char text[16];
+  } last;
+  if (last.valid && last.t == t && last.zone == timezone && last.daylight == daylight) {
+    std::memcpy(out, last.text, 16);
+    return;
+  }
   struct tm local;
   if (localtime_r(&t, &local) == nullptr) {
     std::memset(out, '0', 16);
@@ -61,6 +77,11 @@ void TimeSince70ToMordel(time_t t, char* out) {
   snprintf(text, sizeof(text), "%03d%02d%02d%02d%02d%02d000", local.tm_year, local.tm_mon + 1,
            local.tm_mday, local.tm_hour, local.tm_min, local.tm_sec);
   std::memcpy(out, text, 16);
+  std::memcpy(last.text, text, 16);
+  last.t = t;
+  last.zone = timezone;
+  last.daylight = daylight;
+  last.valid = true;
 }
 
 time_t MordelToTimeSince70(const char* text) {

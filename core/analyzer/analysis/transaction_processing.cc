@@ -36,7 +36,8 @@ void UpdateTable(COverTimeTrees& trees, OverTimeTable table, CDPXTransaction& w,
   const std::size_t hash = key.indexHash();
   Row* row = static_cast<Row*>(trees.find(table, hash, key));
   if (row == nullptr) {
-    auto fresh = std::make_unique<Row>(w);
+    auto fresh = std::make_unique<Row>(key);  // a copy: building it from w again costs more
+    fresh->setDeleteOnRemoval(true);
     fresh->reset(w.getTimeRecorded());
     if (!trees.add(table, fresh.get(), hash)) {
       CLOG::min("%s", refusal);
