@@ -58,10 +58,11 @@ AVLNode* AVLTree::findAVLNode(TreeNode* key) {
   MTreeNode probe(key);
   AVLNode* node = root;
   while (node != nullptr) {
-    if (node->value->equals(probe, compareMode)) {
+    const int order = probe.compare(*node->value, compareMode);
+    if (order == 0) {
       break;
     }
-    node = probe.greater(*node->value, compareMode) ? node->right : node->left;
+    node = order > 0 ? node->right : node->left;
   }
   if (node != nullptr) {
     moveToMostRecent(node->value);
@@ -194,6 +195,21 @@ TreeNode* AVLTree::findNode(TreeNode* key) {
 
 bool AVLTree::isTreeEmpty() {
   return root == nullptr;
+}
+
+void AVLTree::collectInOrder(std::vector<TreeNode*>& nodes) const {
+  std::vector<const AVLNode*> pending;  // nodes whose left side is being walked
+  const AVLNode* node = root;
+  while (node != nullptr || !pending.empty()) {
+    while (node != nullptr) {
+      pending.push_back(node);
+      node = node->left;
+    }
+    node = pending.back();
+    pending.pop_back();
+    nodes.push_back(node->value->getTreeNode());
+    node = node->right;
+  }
 }
 
 TreeNode* AVLTree::getRoot() {

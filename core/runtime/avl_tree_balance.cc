@@ -65,7 +65,8 @@ AVLNode* AVLTree::insertNode(AVLNode* node, MTreeNode* wrapper, bool& heightChan
     heightChanged = added = created != nullptr;
     return created;
   }
-  if (wrapper->greater(*node->value, compareMode)) {
+  const int order = wrapper->compare(*node->value, compareMode);
+  if (order > 0) {
     node->right = insertNode(node->right, wrapper, heightChanged, added);
     if (heightChanged && added) {
       switch (node->skew) {
@@ -83,7 +84,7 @@ AVLNode* AVLTree::insertNode(AVLNode* node, MTreeNode* wrapper, bool& heightChan
     }
     return node;
   }
-  if (!allowDuplicates && wrapper->equals(*node->value, compareMode)) {
+  if (!allowDuplicates && order == 0) {
     added = false;
     return node;
   }

@@ -27,6 +27,11 @@ bool MTreeNode::greater(TreeNode& other, int mode) {
   return treeNode != nullptr && theirs != nullptr && treeNode->greater(*theirs, mode);
 }
 
+int MTreeNode::compare(TreeNode& other, int mode) {
+  TreeNode* theirs = Wrapped(other);
+  return treeNode != nullptr && theirs != nullptr ? treeNode->compare(*theirs, mode) : -1;
+}
+
 const char* MTreeNode::toString(int mode) {
   return treeNode != nullptr ? treeNode->toString(mode) : nullptr;
 }

@@ -32,6 +32,11 @@ class TreeNode {
   // Notifications around insertion and removal; by default nothing happens.
   virtual void removingFromTree() {}
   virtual void addingToTree() {}
+  // greater and equals in one: 1 when this sorts after other, 0 when equal, else -1. A search
+  // asks this once per level; objects whose key can answer in one pass override it.
+  virtual int compare(TreeNode& other, int mode) {
+    return greater(other, mode) ? 1 : (equals(other, mode) ? 0 : -1);
+  }
 };
 
 class MTreeNode : public TreeNode {
@@ -48,6 +53,7 @@ class MTreeNode : public TreeNode {
   // answers null and setDeleteOnRemoval does nothing.
   bool equals(TreeNode& other, int mode) override;
   bool greater(TreeNode& other, int mode) override;
+  int compare(TreeNode& other, int mode) override;
   const char* toString(int mode) override;
   bool getDeleteOnRemoval() override;
   void setDeleteOnRemoval(bool deleteOnRemoval) override;

@@ -1,5 +1,6 @@
 // The index in front of each over-time tree finds exactly the row the tree's own search finds,
-// over random keys: names that differ only past a field's width, fill it exactly, or are empty.
+// and a row's one-pass compare answers as greater and equals do, over random keys: names that
+// differ only past a field's width, fill it exactly, or are empty.
 
 #include "core/analyzer/analysis/over_time_trees.h"
 
@@ -7,6 +8,7 @@
 
 #include <memory>
 #include <random>
+#include <utility>
 #include <string>
 #include <vector>
 
@@ -38,6 +40,7 @@ template <class Row>
 void ExpectIndexAgreesWithTree(OverTimeTable table) {
   std::mt19937 random(11);
   COverTimeTrees trees;
+  std::unique_ptr<Row> previous;
   int found = 0;
   for (int i = 0; i < 3000; ++i) {
     std::string url = "/" + Name(random);
@@ -56,6 +59,13 @@ void ExpectIndexAgreesWithTree(OverTimeTable table) {
     Row probe(t);
     probe.setDeleteOnRemoval(false);
     const std::size_t hash = probe.indexHash();
+    if (previous != nullptr) {
+      for (auto [a, b] : {std::pair<Row*, Row*>{&probe, previous.get()}, {previous.get(), &probe},
+                          {&probe, &probe}}) {
+        const int literal = a->greater(*b, 0) ? 1 : (a->equals(*b, 0) ? 0 : -1);
+        ASSERT_EQ(literal, a->compare(*b, 0)) << "transaction " << i;
+      }
+    }
     TreeNode* const viaTree = trees.tree(table).findNode(&probe);
     ASSERT_EQ(viaTree, trees.find(table, hash, probe)) << "transaction " << i;
     found += viaTree != nullptr;
@@ -64,6 +74,7 @@ void ExpectIndexAgreesWithTree(OverTimeTable table) {
       ASSERT_TRUE(trees.add(table, row.get(), hash));
       row.release();
     }
+    previous = std::make_unique<Row>(t);
   }
   // Both outcomes happened often enough to mean something.
   EXPECT_GT(found, 300);

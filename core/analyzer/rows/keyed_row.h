@@ -158,6 +158,16 @@ template <const auto& kSpec>
 class TKeyedRow : public CBaseTable {
  public:
   static constexpr std::size_t kKeys = std::size(kSpec.fields);
+  static constexpr bool OrderIsPermutation() {
+    bool seen[kKeys] = {};
+    for (int i : kSpec.order) {
+      if (i < 0 || static_cast<std::size_t>(i) >= kKeys || seen[i]) {
+        return false;
+      }
+      seen[i] = true;
+    }
+    return true;
+  }
 
   bool equals(TreeNode& other, int) override {
     const TKeyedRow& o = static_cast<const TKeyedRow&>(other);
@@ -178,6 +188,20 @@ class TKeyedRow : public CBaseTable {
       }
     }
     return false;
+  }
+
+  // greater and equals in one pass: the order names every field once, so rows equal in all
+  // of them are equal.
+  int compare(TreeNode& other, int) override {
+    static_assert(OrderIsPermutation(), "a key order must name every field once");
+    const TKeyedRow& o = static_cast<const TKeyedRow&>(other);
+    for (int i : kSpec.order) {
+      const int c = strncmp(key(i), o.key(i), KeyWidth(kSpec.fields[i]));
+      if (c != 0) {
+        return c > 0 ? 1 : -1;
+      }
+    }
+    return 0;
   }
 
   const char* toString(int) override {
