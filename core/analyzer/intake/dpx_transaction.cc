@@ -17,6 +17,10 @@ CDPXTransaction::CDPXTransaction() : recordType_(0) {
 }
 
 CDPXTransaction::CDPXTransaction(const SM3_HPAGE_ENTRY& entry) : entry_(entry), recordType_(0) {
+  adoptEntry();
+}
+
+void CDPXTransaction::adoptEntry() {
   static const char* const kWhere = "CDPXTransaction::CDPXTransaction(SM3_HPAGE_ENTRY)";
   if (entry_.iNetworkTime < 0) {
     CLOG::min("%s input iNetworkTime[%ld] is negative", kWhere,

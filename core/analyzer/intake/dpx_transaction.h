@@ -20,6 +20,15 @@ class CDPXTransaction : public CTransaction {
   // Copies the entry, clamps a negative network time to 0 (with a trace), names the record from
   // it and sets the true trans type to 5.
   explicit CDPXTransaction(const SM3_HPAGE_ENTRY& entry);
+  // The same with the entry written in place: fill(entry) gets it zeroed and returns whether it
+  // filled it; only then is the record named as above. Spares the parser a copy of the entry.
+  enum FilledInPlace { kFilledInPlace };
+  template <class Fill>
+  CDPXTransaction(FilledInPlace, Fill fill) : entry_{}, recordType_(0) {
+    if (fill(entry_)) {
+      adoptEntry();
+    }
+  }
   CDPXTransaction(const CDPXTransaction&) = default;
   CDPXTransaction& operator=(const CDPXTransaction&) = default;
 
@@ -85,6 +94,9 @@ class CDPXTransaction : public CTransaction {
   void dump() const;
 
  private:
+  // What the entry constructors do once entry_ holds the record: clamp, terminate, name.
+  void adoptEntry();
+
   SM3_HPAGE_ENTRY entry_;
   int32_t recordType_;  // SM3_RECORD_*
 };

@@ -11,13 +11,85 @@ namespace {
 // Longest content quoted whole in the failure trace.
 constexpr size_t kMaxQuotedLine = 7000;
 
-// Reads the fields of line into entry by its layout. The caret count has been checked, so
-// every field is present.
-template <size_t N>
-void ReadFields(char* line, const SM3_FIELD_SLOT (&layout)[N], void* entry) {
+// The value of a field's first min(length, 16) characters, as getNextInteger reads them.
+int32_t FieldInteger(const char* start, size_t length) {
+  char field[17];
+  const size_t n = length < 16 ? length : 16;
+  memcpy(field, start, n);
+  field[n] = '\0';
+  return static_cast<int32_t>(decimalFieldValue(field));
+}
+
+}  // namespace
+
+namespace sm3_internal {
+
+int FindCarets(const char* line, const char** carets, int capacity) {
+  // Eight bytes at a time, as countCarets counts: a byte of x is zero exactly where the line
+  // holds a caret, and the expression sets the top bit of exactly those bytes.
+  constexpr uint64_t kOnes7 = 0x7F7F7F7F7F7F7F7FULL;
+  constexpr uint64_t kCarets = 0x5E5E5E5E5E5E5E5EULL;
+  static_assert(CARET == 0x5E);
+  const size_t length = strlen(line);
+  int count = 0;
+  size_t i = 0;
+  for (; i + 8 <= length; i += 8) {
+    uint64_t word;
+    memcpy(&word, line + i, sizeof(word));
+    const uint64_t x = word ^ kCarets;
+    uint64_t tops = ~(((x & kOnes7) + kOnes7) | x | kOnes7);
+    while (tops != 0) {
+      if (count < capacity) {
+        carets[count] = line + i + static_cast<size_t>(__builtin_ctzll(tops)) / 8;
+      }
+      ++count;
+      tops &= tops - 1;
+    }
+  }
+  for (; i < length; ++i) {
+    if (line[i] == CARET) {
+      if (count < capacity) {
+        carets[count] = line + i;
+      }
+      ++count;
+    }
+  }
+  return count;
+}
+
+void ReadFieldsAt(const char* line, const char* const* carets, const SM3_FIELD_SLOT* layout,
+                  size_t fields, void* entry) {
+  char* base = static_cast<char*>(entry);
+  for (size_t k = 0; k < fields; ++k) {
+    const SM3_FIELD_SLOT& slot = layout[k];
+    const char* start = k == 0 ? line : carets[k - 1] + 1;
+    // The last field has no caret behind it and is read as its first character only.
+    const size_t length =
+        k + 1 < fields ? static_cast<size_t>(carets[k] - start) : (*start != '\0' ? 1 : 0);
+    char* field = base + slot.offset;
+    switch (slot.kind) {
+      case SM3FieldKind::kText: {
+        const size_t n = length < static_cast<size_t>(slot.width - 1) ? length : slot.width - 1;
+        memcpy(field, start, n);
+        field[n] = '\0';
+        break;
+      }
+      case SM3FieldKind::kInteger: {
+        const int32_t value = FieldInteger(start, length);
+        memcpy(field, &value, sizeof(value));
+        break;
+      }
+      case SM3FieldKind::kSkipped:
+        break;
+    }
+  }
+}
+
+void ReadFieldsLiteral(char* line, const SM3_FIELD_SLOT* layout, size_t fields, void* entry) {
   char* cursor = line;
   char* base = static_cast<char*>(entry);
-  for (const SM3_FIELD_SLOT& slot : layout) {
+  for (size_t k = 0; k < fields; ++k) {
+    const SM3_FIELD_SLOT& slot = layout[k];
     char* field = base + slot.offset;
     switch (slot.kind) {
       case SM3FieldKind::kText:
@@ -35,13 +107,22 @@ void ReadFields(char* line, const SM3_FIELD_SLOT (&layout)[N], void* entry) {
   }
 }
 
-bool HasCarets(char* line, int expected, const char* where) {
-  if (CCommon::countCarets(line) == expected) {
-    return true;
+}  // namespace sm3_internal
+
+namespace {
+
+// Checks the caret count and reads the fields of line into entry by its layout, finding every
+// caret in one pass. False, with the trace, when the count is wrong.
+template <size_t N>
+bool ReadFields(char* line, const SM3_FIELD_SLOT (&layout)[N], void* entry, const char* where) {
+  const char* carets[N];
+  if (sm3_internal::FindCarets(line, carets, N) != static_cast<int>(N) - 1) {
+    // The BEL after the location marks the record as an error for whoever reads the trace.
+    CLOG::trace(64, "%s \aERROR Wrong number of carets in this line\n", where);
+    return false;
   }
-  // The BEL after the location marks the record as an error for whoever reads the trace.
-  CLOG::trace(64, "%s \aERROR Wrong number of carets in this line\n", where);
-  return false;
+  sm3_internal::ReadFieldsAt(line, carets, layout, N, entry);
+  return true;
 }
 
 void ClampNetworkTime(int32_t* networkTime, const char* where) {
@@ -56,24 +137,26 @@ void ClampNetworkTime(int32_t* networkTime, const char* where) {
 
 std::unique_ptr<CDPXTransaction> processHSM3Line(char* line) {
   static const char* const kWhere = "processHSM3Line";
-  if (!HasCarets(line, SM3_HPAGE_CARETS, kWhere)) {
-    return nullptr;
-  }
-  SM3_HPAGE_ENTRY entry;
-  memset(&entry, 0, sizeof(entry));
-  ReadFields(line, SM3_HPAGE_LAYOUT, &entry);
-  ClampNetworkTime(&entry.iNetworkTime, kWhere);
-  return std::make_unique<CDPXTransaction>(entry);
+  // Parsed straight into the transaction's own entry: no copy of the record on the way.
+  bool parsed = false;
+  auto transaction = std::make_unique<CDPXTransaction>(
+      CDPXTransaction::kFilledInPlace, [&](SM3_HPAGE_ENTRY& entry) {
+        parsed = ReadFields(line, SM3_HPAGE_LAYOUT, &entry, kWhere);
+        if (parsed) {
+          ClampNetworkTime(&entry.iNetworkTime, kWhere);
+        }
+        return parsed;
+      });
+  return parsed ? std::move(transaction) : nullptr;
 }
 
 std::unique_ptr<CDPXTransaction> processAVSM3Line(char* line) {
   static const char* const kWhere = "processAVSM3Line";
-  if (!HasCarets(line, SM3_AV_CARETS, kWhere)) {
-    return nullptr;
-  }
   _SM3_AV_ENTRY object;
   memset(&object, 0, sizeof(object));
-  ReadFields(line, SM3_AV_LAYOUT, &object);
+  if (!ReadFields(line, SM3_AV_LAYOUT, &object, kWhere)) {
+    return nullptr;
+  }
   ClampNetworkTime(&object.iNetworkTime, kWhere);
   SM3_HPAGE_ENTRY entry;
   convertAVEtoHPE(&object, &entry);

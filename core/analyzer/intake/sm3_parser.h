@@ -9,9 +9,11 @@
 //
 // Thread safety: no shared state.
 
+#include <cstddef>
 #include <memory>
 
 #include "core/analyzer/intake/dpx_transaction.h"
+#include "core/analyzer/intake/sm3_fields.h"
 
 // A page line (record types 1 and 2): 46 fields. Null when the line is rejected (with a trace).
 // A negative network time is traced and stored as 0.
@@ -26,3 +28,18 @@ std::unique_ptr<CDPXTransaction> processAVSM3Line(char* line);
 // record type outside 1 to 4) is traced with its content, quoted up to 7000 characters, and
 // null is returned; the caller moves on to the next record.
 std::unique_ptr<CDPXTransaction> createDPXTransaction(char* line, int recordType);
+
+// The field reader's two halves, and the literal cursor-by-cursor reader it replaces, for tests
+// that compare them on random lines. Not for production callers.
+namespace sm3_internal {
+
+// Counts the carets of line (up to its NUL) and stores the positions of the first capacity.
+int FindCarets(const char* line, const char** carets, int capacity);
+// Reads fields (a layout's slot count) into entry from line, whose first fields - 1 carets are
+// in carets.
+void ReadFieldsAt(const char* line, const char* const* carets, const SM3_FIELD_SLOT* layout,
+                  size_t fields, void* entry);
+// The same through getNextField/getNextInteger/skipField, advancing a cursor field by field.
+void ReadFieldsLiteral(char* line, const SM3_FIELD_SLOT* layout, size_t fields, void* entry);
+
+}  // namespace sm3_internal

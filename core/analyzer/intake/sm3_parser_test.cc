@@ -2,7 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include <cstdlib>
 #include <string>
+#include <vector>
 
 #include "core/analyzer/intake/sm3_fields.h"
 #include "framework/trace_capture.h"
@@ -83,6 +85,54 @@ TEST(CaretCountTest, WrongCountsAreRejectedWithBelMarker) {
   EXPECT_FALSE(Av(AvLine() + "^0"));
   EXPECT_FALSE(Av(PageLine()));
   EXPECT_TRUE(capture.contains("processAVSM3Line \aERROR Wrong number of carets in this line"));
+}
+
+// The one-pass reader (every caret found at once, fields read from their positions) fills an
+// entry byte for byte as the literal cursor-by-cursor reader does, on random lines of both
+// layouts: fields empty, over their slot's width, with signs, blanks and non-digits in numbers,
+// 16-digit and longer numbers, and last fields of zero to several characters.
+TEST(FieldReaderTest, OnePassReaderAgreesWithTheLiteralOne) {
+  std::srand(20261126);
+  const std::string pieces[] = {"", "0", "7", "-", "+", " ", "\t", "12", "x", "/a/b.html",
+                                "99999999999999999999", "1234567890123456", "-42", "3.5",
+                                std::string(300, 'w'), "\xc3\xa9"};
+  const auto randomField = [&] {
+    std::string field;
+    for (int n = std::rand() % 4; n > 0; --n) {
+      field += pieces[static_cast<size_t>(std::rand()) % std::size(pieces)];
+    }
+    return field;
+  };
+  struct Layout {
+    const SM3_FIELD_SLOT* slots;
+    size_t fields;
+    size_t entrySize;
+  };
+  const Layout layouts[] = {{SM3_HPAGE_LAYOUT, SM3_HPAGE_FIELDS, sizeof(SM3_HPAGE_ENTRY)},
+                            {SM3_AV_LAYOUT, SM3_AV_FIELDS, sizeof(_SM3_AV_ENTRY)}};
+  for (int round = 0; round < 4000; ++round) {
+    const Layout& layout = layouts[round % 2];
+    std::string line;
+    for (size_t k = 0; k < layout.fields; ++k) {
+      line += (k == 0 ? "" : "^") + randomField();
+    }
+    std::vector<const char*> carets(layout.fields);
+    ASSERT_EQ(static_cast<int>(layout.fields) - 1,
+              sm3_internal::FindCarets(line.c_str(), carets.data(), static_cast<int>(layout.fields)));
+    std::vector<char> fast(layout.entrySize, 0);
+    std::vector<char> literal(layout.entrySize, 0);
+    sm3_internal::ReadFieldsAt(line.c_str(), carets.data(), layout.slots, layout.fields,
+                               fast.data());
+    std::string copy = line;
+    sm3_internal::ReadFieldsLiteral(copy.data(), layout.slots, layout.fields, literal.data());
+    ASSERT_TRUE(fast == literal) << "line " << round << ": " << line;
+  }
+  // Counting runs on past the positions it may store.
+  const char* const text = "a^b^^c^d^";
+  const char* few[2] = {};
+  EXPECT_EQ(5, sm3_internal::FindCarets(text, few, 2));
+  EXPECT_EQ(text + 1, few[0]);
+  EXPECT_EQ(text + 3, few[1]);
 }
 
 // An object line keeps its shared fields, URL, status and network time; the two object-only
