@@ -41,6 +41,12 @@ class COverTimeTrees {
   // The row of table equal to probe, whose key hashes to hash (TKeyedRow::indexHash), or null:
   // a hash lookup in front of the tree, which stays the ordered store and the rows' owner.
   TreeNode* find(OverTimeTable table, std::size_t hash, TreeNode& probe) const;
+  // The same with the key given by a predicate over candidate rows (same(row) true when row has
+  // the key), for lookups that build no probe row.
+  template <class Same>
+  TreeNode* findIf(OverTimeTable table, std::size_t hash, Same same) const {
+    return index_[static_cast<int>(table)].find(hash, same);
+  }
   // Adds row (whose key hashes to hash) to table's tree and index; false when the tree refused
   // it (the caller keeps it).
   bool add(OverTimeTable table, TreeNode* row, std::size_t hash);

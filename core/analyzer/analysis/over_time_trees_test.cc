@@ -59,6 +59,12 @@ void ExpectIndexAgreesWithTree(OverTimeTable table) {
     Row probe(t);
     probe.setDeleteOnRemoval(false);
     const std::size_t hash = probe.indexHash();
+    // Asked of the transaction itself, without building a row: the same hash and equality.
+    ASSERT_EQ(hash, Row::indexHashOf(t)) << "transaction " << i;
+    ASSERT_TRUE(probe.hasKeyOf(t));
+    if (previous != nullptr) {
+      ASSERT_EQ(previous->equals(probe, 0), previous->hasKeyOf(t)) << "transaction " << i;
+    }
     if (previous != nullptr) {
       for (auto [a, b] : {std::pair<Row*, Row*>{&probe, previous.get()}, {previous.get(), &probe},
                           {&probe, &probe}}) {
@@ -68,6 +74,9 @@ void ExpectIndexAgreesWithTree(OverTimeTable table) {
     }
     TreeNode* const viaTree = trees.tree(table).findNode(&probe);
     ASSERT_EQ(viaTree, trees.find(table, hash, probe)) << "transaction " << i;
+    ASSERT_EQ(viaTree, trees.findIf(table, hash, [&t](TreeNode* row) {
+      return static_cast<Row*>(row)->hasKeyOf(t);
+    })) << "transaction " << i;
     found += viaTree != nullptr;
     if (viaTree == nullptr && random() % 3 != 0) {
       auto row = std::make_unique<Row>(t);

@@ -26,18 +26,16 @@ constexpr int kAggByApplication = 1;
 constexpr int kAggByClient = 2;
 constexpr int kAggByTransaction = 4;
 
-// Builds the row of Row for w, finds its equal in table (through the trees' index), or adds a
-// new one starting at the transaction's interval; then adds w to it.
+// Finds the row of Row with w's key in table (through the trees' index, without building a
+// lookup row), or adds a new one starting at the transaction's interval; then adds w to it.
 template <class Row>
 void UpdateTable(COverTimeTrees& trees, OverTimeTable table, CDPXTransaction& w,
                  const char* refusal) {
-  Row key(w);
-  key.setDeleteOnRemoval(false);  // a lookup key: the tree must not destroy it
-  const std::size_t hash = key.indexHash();
-  Row* row = static_cast<Row*>(trees.find(table, hash, key));
+  const std::size_t hash = Row::indexHashOf(w);
+  Row* row = static_cast<Row*>(trees.findIf(
+      table, hash, [&w](TreeNode* candidate) { return static_cast<Row*>(candidate)->hasKeyOf(w); }));
   if (row == nullptr) {
-    auto fresh = std::make_unique<Row>(key);  // a copy: building it from w again costs more
-    fresh->setDeleteOnRemoval(true);
+    auto fresh = std::make_unique<Row>(w);
     fresh->reset(w.getTimeRecorded());
     if (!trees.add(table, fresh.get(), hash)) {
       CLOG::min("%s", refusal);

@@ -220,14 +220,39 @@ class TKeyedRow : public CBaseTable {
   std::size_t indexHash() const {
     std::size_t h = 0;
     for (std::size_t i = 0; i < kKeys; ++i) {
-      const std::string_view field(key(i), strnlen(key(i), KeyWidth(kSpec.fields[i])));
-      h = h * 1000003u ^ std::hash<std::string_view>{}(field);
+      h = HashStep(h, key(i), KeyWidth(kSpec.fields[i]));
     }
     return h;
+  }
+  // What indexHash and equals would answer for a row built from t, without building one: the
+  // lookup of an existing row then copies no key.
+  static std::size_t indexHashOf(const CTransaction& t) {
+    std::size_t h = 0;
+    for (std::size_t i = 0; i < kKeys; ++i) {
+      h = HashStep(h, KeySource(t, kSpec.fields[i]), KeyWidth(kSpec.fields[i]));
+    }
+    return h;
+  }
+  bool hasKeyOf(const CTransaction& t) const {
+    for (std::size_t i = 0; i < kKeys; ++i) {
+      if (strncmp(key(i), KeySource(t, kSpec.fields[i]), KeyWidth(kSpec.fields[i])) != 0) {
+        return false;
+      }
+    }
+    return true;
   }
 
   // The key field in storage position i, KeyWidth bytes, NUL-padded, unterminated when full.
   const char* key(std::size_t i) const { return keys_ + kOffsets.at[i]; }
+
+ private:
+  // Each field counts up to its first NUL or its width, as CopyField keeps it.
+  static std::size_t HashStep(std::size_t h, const char* field, std::size_t width) {
+    const std::string_view text(field, strnlen(field, width));
+    return h * 1000003u ^ std::hash<std::string_view>{}(text);
+  }
+
+ public:
   const Carried& carried() const { return carried_; }
 
  protected:
