@@ -103,8 +103,12 @@ int findHeader(char* buffer, char** headerStart, char** trailerStart, int* heade
   return 0;
 }
 
-std::unique_ptr<char[]> getSM3Line(char** cursor, long* remaining, bool fullBuffer, long* consumed,
-                                   int* recordType) {
+namespace {
+
+// Finds the next record at *cursor and moves past it as getSM3Line does; returns its content's
+// start (in the buffer, not terminated) and sets *trailer, or null.
+char* nextRecord(char** cursor, long* remaining, bool fullBuffer, long* consumed, int* recordType,
+                 char** trailerAt) {
   *consumed = 0;
   char* header = nullptr;
   char* trailer = nullptr;
@@ -119,22 +123,41 @@ std::unique_ptr<char[]> getSM3Line(char** cursor, long* remaining, bool fullBuff
     }
     return nullptr;
   }
-  const char* content = header + headerLength;
+  char* content = header + headerLength;
   const long contentLength = trailer - content;
-  std::unique_ptr<char[]> line(new (std::nothrow) char[contentLength + 1]);
-  if (!line) {
-    CLOG::min("ERROR new failed for linelen[%lu]", static_cast<unsigned long>(contentLength));
-    return nullptr;
-  }
-  memcpy(line.get(), content, contentLength);
-  line[contentLength] = '\0';
-
   const long eolCount = CCommon::findEOLChars(trailer + trailerLength);
   const long recordLength = headerLength + contentLength + trailerLength + eolCount;
   // The cursor passes any bytes before the header, but only the record itself is consumed.
   *cursor = header + recordLength;
   *remaining -= recordLength;
   *consumed = recordLength;
+  *trailerAt = trailer;
+  return content;
+}
+
+}  // namespace
+
+std::unique_ptr<char[]> getSM3Line(char** cursor, long* remaining, bool fullBuffer, long* consumed,
+                                   int* recordType) {
+  char* const start = *cursor;
+  const long before = *remaining;
+  char* trailer = nullptr;
+  const char* content = nextRecord(cursor, remaining, fullBuffer, consumed, recordType, &trailer);
+  if (content == nullptr) {
+    return nullptr;
+  }
+  const long contentLength = trailer - content;
+  std::unique_ptr<char[]> line(new (std::nothrow) char[contentLength + 1]);
+  if (!line) {
+    CLOG::min("ERROR new failed for linelen[%lu]", static_cast<unsigned long>(contentLength));
+    // Not taken after all: the record stays where it was, to be read again later.
+    *cursor = start;
+    *remaining = before;
+    *consumed = 0;
+    return nullptr;
+  }
+  memcpy(line.get(), content, contentLength);
+  line[contentLength] = '\0';
   return line;
 }
 
@@ -149,9 +172,18 @@ long processDPXContents(char* chunk, long length, bool fullBuffer, CSM3RecordSin
   do {
     long consumed = 0;
     int recordType = 0;
-    std::unique_ptr<char[]> line =
-        getSM3Line(&cursor, &remaining, fullBuffer, &consumed, &recordType);
-    if (!line || !sink.processSM3Line(line.get(), recordType)) {
+    char* trailer = nullptr;
+    char* line = nextRecord(&cursor, &remaining, fullBuffer, &consumed, &recordType, &trailer);
+    if (line == nullptr) {
+      break;
+    }
+    // The content is handed over where it lies, ended for the call by a NUL over the trailer's
+    // first byte, which is put back after.
+    const char kept = *trailer;
+    *trailer = '\0';
+    const bool taken = sink.processSM3Line(line, recordType);
+    *trailer = kept;
+    if (!taken) {
       break;
     }
     total += consumed;

@@ -35,8 +35,9 @@ std::unique_ptr<char[]> getSM3Line(char** cursor, long* remaining, bool fullBuff
 class CSM3RecordSink {
  public:
   virtual ~CSM3RecordSink() = default;
-  // Called for each complete record with its content and record type. The content is the
-  // caller's, valid for this call only; the sink may modify it. Returning false stops the pass at
+  // Called for each complete record with its content and record type. The content lies in the
+  // chunk, ended by a NUL for this call only; the sink may modify it, but no further than its
+  // NUL, and must not keep it. Returning false stops the pass at
   // this record, which is then not consumed (a record dropped at shutdown is read again at the
   // next start).
   virtual bool processSM3Line(char* line, int recordType) = 0;

@@ -180,12 +180,17 @@ TEST(ProcessContentsTest, WholeRecordsOnly) {
   EXPECT_EQ(std::make_pair(4, std::string("v")), pass.records[2]);
 }
 
-// A record the sink refuses (shutdown) and everything after it stay unconsumed.
+// A record the sink refuses (shutdown) and everything after it stay unconsumed, and the chunk,
+// whose records are handed over in place, reads as it did.
 TEST(ProcessContentsTest, RefusedRecordIsNotConsumed) {
   const std::string first = Record(1, "p");
-  Pass pass = RunPass(first + Record(2, "o") + Record(2, "o"), false, 1);
-  EXPECT_EQ(static_cast<long>(first.size()), pass.consumed);
-  EXPECT_EQ(1u, pass.records.size());
+  std::string chunk = first + Record(2, "o") + Record(2, "o");
+  const std::string original = chunk;
+  RecordingSink sink(1);
+  EXPECT_EQ(static_cast<long>(first.size()),
+            processDPXContents(chunk.data(), static_cast<long>(chunk.size()), false, sink));
+  EXPECT_EQ(1u, sink.records.size());
+  EXPECT_EQ(original, chunk);
 }
 
 // A NUL byte in a data file neither hides the records after it nor stalls the offset.
