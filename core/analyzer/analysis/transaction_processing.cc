@@ -7,7 +7,6 @@
 
 #include <cstring>
 #include <memory>
-#include <optional>
 
 #include "core/analyzer/analysis/instance_rows.h"
 #include "core/analyzer/dpx_analyzer.h"
@@ -215,7 +214,6 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
   CSituationController& controller = situations();
   TransactionMatch* txMatches = nullptr;
   ClientMatch* clientMatches = nullptr;
-  std::optional<TransactionMatch> madeUpTx;
   bool madeUp = false;
   if (page) {
     txMatches = controller.matchTransactionPatterns(
@@ -228,9 +226,11 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
     }
   } else {
     madeUp = true;
-    madeUpTx.emplace(ObjectMatch());
-    madeUpTx->pattern.collectInstances = *instanceLevel;
-    txMatches = &*madeUpTx;
+    // One made-up match per thread, reused: clearing and copying a match (over a kilobyte) for
+    // every object cost more than the object's own processing.
+    thread_local TransactionMatch objectMatch = ObjectMatch();
+    objectMatch.pattern.collectInstances = *instanceLevel;
+    txMatches = &objectMatch;
     clientMatches = const_cast<ClientMatch*>(&OwnClientIdentity());
   }
   CLOG::med("Processing transaction tTemp[%p] appName[%s] tranName[%s]",
