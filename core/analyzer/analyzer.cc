@@ -65,7 +65,7 @@ void CAnalyzer::Shutdown() {
 }
 
 int32_t CAnalyzer::getQueueDepthHint() const {
-  return newQueue && !newQueue->IsEmpty() ? 1 : 0;
+  return (newQueue && !newQueue->IsEmpty()) || heldItems.load() > 0 ? 1 : 0;
 }
 
 void CAnalyzer::updateCurrentOverTimeInterval() {

@@ -73,8 +73,9 @@ class CAnalyzer : public TransactionSink {
   // empty and this equal to what the intake queued, the tables are final.
   int64_t getTransactionsTaken() const { return transactionsTaken.load(); }
   int32_t getQueueDepthHint() const;
-  // Transactions waiting in the queue now.
-  long getQueueDepth() const { return newQueue ? newQueue->Size() : 0; }
+  // Transactions waiting now: in the queue, or taken out with the analyzer's current batch and
+  // not yet processed.
+  long getQueueDepth() const { return (newQueue ? newQueue->Size() : 0) + heldItems.load(); }
 
  protected:
   std::unique_ptr<CSituationController> situationController;
@@ -82,6 +83,7 @@ class CAnalyzer : public TransactionSink {
   std::atomic<int32_t> transactionsProcessed{0};
   std::atomic<int32_t> transactionsIgnored{0};
   std::atomic<int64_t> transactionsTaken{0};    // analyzer thread writes, anyone reads
+  std::atomic<long> heldItems{0};  // of the analyzer's current batch; it writes, anyone reads
   std::atomic<int64_t> totalProcessingTime{0};  // ms
   int32_t oldTransactions = 0;       // restamped into this interval; analyzer thread only
   int32_t transactionsReceived = 0;  // handed to processing in this interval; analyzer thread

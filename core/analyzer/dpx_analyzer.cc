@@ -1,5 +1,6 @@
 #include "core/analyzer/dpx_analyzer.h"
 
+#include <algorithm>
 #include <atomic>
 #include <cstring>
 #include <mutex>
@@ -154,6 +155,11 @@ void CDPXAnalyzer::Run() {
   // the full queue, which only this loop empties.
   std::thread feederStopper;
   std::atomic<bool> feederStopped{false};
+  // Items are taken a batch at a time: one lock and one wake-up of the readers per batch.
+  constexpr unsigned long kBatch = 32;
+  _TYPED_TRANSACTION batch[kBatch];
+  long batchSize = 0;
+  long batchNext = 0;
   for (;;) {
     if (isShutdownRequested()) {
       if (!shutdownSeen) {
@@ -169,7 +175,7 @@ void CDPXAnalyzer::Run() {
         }
       }
       // Once the feeder has stopped nothing more arrives, so an empty queue is the end.
-      if (feederStopped.load() && newQueue->IsEmpty()) {
+      if (feederStopped.load() && newQueue->IsEmpty() && batchNext == batchSize) {
         if (feederStopper.joinable()) {
           feederStopper.join();
         }
@@ -177,11 +183,19 @@ void CDPXAnalyzer::Run() {
         return;
       }
     }
+    if (batchNext == batchSize) {
+      // While the feeder stops, wait briefly so its end is noticed at once.
+      const long wait = shutdownSeen ? kShutdownWaitMillis : kQueueWaitMillis;
+      batchSize = std::max(0L, newQueue->GetBatch(batch, kBatch, wait));
+      batchNext = 0;
+    }
     _TYPED_TRANSACTION item;
-    // An item without a transaction only wakes the loop (Shutdown queues one). While the feeder
-    // stops, wait briefly so its end is noticed at once.
-    const long wait = shutdownSeen ? kShutdownWaitMillis : kQueueWaitMillis;
-    const bool got = newQueue->Get(item, wait) == 0 && item.transaction != nullptr;
+    if (batchNext < batchSize) {
+      item = batch[batchNext++];
+    }
+    heldItems.store(batchSize - batchNext);
+    // An item without a transaction only wakes the loop (Shutdown queues one).
+    const bool got = item.transaction != nullptr;
     if (got && item.type != TRANSACTION_KIND_DPX) {
       CLOG::min(
           "This transaction of type[%d] is not for this Analyzer[%d], it needs to be converted",

@@ -105,6 +105,38 @@ class TvelQueue {
     }
   }
 
+  // Takes up to max of the oldest items into out[0..) in order, waiting as Get does: the count
+  // taken (at least 1; 0 only when max is 0), or Get's status when nothing was (statuses are
+  // negative). One lock and
+  // one wake-up of the producers serve the whole batch.
+  long GetBatch(T* out, unsigned long max, long timeout_millis) {
+    if (max == 0) {
+      return 0;
+    }
+    for (;;) {
+      const long status = v_notempty.Wait(timeout_millis);
+      if (status != cvel::kOk) {
+        return status;
+      }
+      CvelMutexLock lock(v_queuemutex);
+      const unsigned long queued = v_numofitems.load();
+      if (queued == 0) {
+        continue;
+      }
+      const unsigned long n = queued < max ? queued : max;
+      for (unsigned long i = 0; i < n; ++i) {
+        out[i] = v_items[v_head];
+        v_head = (v_head + 1) % v_currentmaxitem;
+      }
+      v_numofitems.store(queued - n);
+      if (queued == n) {
+        v_notempty.Reset();
+      }
+      v_notfull.Signal();
+      return static_cast<long>(n);
+    }
+  }
+
   bool IsFull() const { return v_numofitems.load(std::memory_order_relaxed) == v_currentmaxitem; }
   bool IsEmpty() const { return v_numofitems.load(std::memory_order_relaxed) == 0; }
   // Items queued now; from any thread, a moment's figure.

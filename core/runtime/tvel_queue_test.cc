@@ -2,8 +2,10 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <cstdlib>
 #include <functional>
 #include <thread>
 #include <vector>
@@ -64,6 +66,54 @@ TEST(TvelQueueTest, FifoAcrossRingWrap) {
     expected.push_back(5000 + i);
   }
   EXPECT_EQ(expected, Drain(queue));
+}
+
+// Batches take what single Gets would, in the same order: random puts and batch sizes over a
+// small ring (wrapping often), a full queue emptied by one batch letting a blocked producer
+// in, and the timeout code when nothing comes.
+TEST(TvelQueueTest, GetBatchTakesWhatGetWould) {
+  Queue queue(7);
+  std::srand(3);
+  uint32_t next = 0;
+  uint32_t expected = 0;
+  _TYPED_TRANSACTION out[10];
+  for (int round = 0; round < 2000; ++round) {
+    for (int n = std::rand() % 8; n > 0 && !queue.IsFull(); --n) {
+      ASSERT_EQ(cvel::kOk, queue.Put(Item(next++)));
+    }
+    if (queue.IsEmpty()) {
+      continue;
+    }
+    const long queued = queue.Size();
+    const unsigned long max = 1 + static_cast<unsigned long>(std::rand()) % 10;
+    const long taken = queue.GetBatch(out, max, 1000);
+    ASSERT_EQ(std::min<long>(queued, static_cast<long>(max)), taken);
+    for (long i = 0; i < taken; ++i) {
+      ASSERT_EQ(expected++, out[i].type);
+    }
+    ASSERT_EQ(queued - taken, queue.Size());
+  }
+  std::vector<uint32_t> rest = Drain(queue);
+  for (uint32_t code : rest) {
+    ASSERT_EQ(expected++, code);
+  }
+  EXPECT_EQ(next, expected);
+
+  for (uint32_t i = 0; i < 7; ++i) {
+    ASSERT_EQ(cvel::kOk, queue.Put(Item(i)));
+  }
+  std::atomic<bool> putDone{false};
+  std::thread producer([&] {
+    queue.Put(Item(7));
+    putDone = true;
+  });
+  EXPECT_EQ(7, queue.GetBatch(out, 10, 1000));
+  ASSERT_TRUE(Eventually([&] { return putDone.load(); }));
+  producer.join();
+  EXPECT_EQ(1, queue.GetBatch(out, 10, 1000));
+  EXPECT_EQ(7u, out[0].type);
+  EXPECT_EQ(-132, queue.GetBatch(out, 10, 10));
+  EXPECT_EQ(0, queue.GetBatch(out, 0, 10));
 }
 
 // Get on an empty queue gives the timeout code and leaves the item alone.
