@@ -57,6 +57,31 @@ bool CAnalyzer::add(_TYPED_TRANSACTION item) {
   return true;
 }
 
+bool CAnalyzer::addBatch(const _TYPED_TRANSACTION* items, size_t n) {
+  static const char* const kWhere = "CAnalyzer::add(TYPED_TRANSACTION)";
+  if (!newQueue) {
+    bool all = true;
+    for (size_t i = 0; i < n; ++i) {
+      all = add(items[i]) && all;
+    }
+    return all;
+  }
+  // As add: let a full queue drain a stretch before queueing again.
+  while (newQueue->IsFull() && !shutdownRequested.load()) {
+    CMisc::sleep(kFullQueuePauseMillis);
+  }
+  unsigned long stored = 0;
+  const long status = newQueue->PutBatch(items, n, &stored);
+  if (status != 0) {
+    CLOG::min("%s ERROR, Failed[%d] to add to newQueue", kWhere, static_cast<int>(status));
+    for (size_t i = stored; i < n; ++i) {
+      delete items[i].transaction;
+    }
+    return false;
+  }
+  return true;
+}
+
 void CAnalyzer::Shutdown() {
   shutdownRequested.store(true);
   if (newQueue && !newQueue->IsFull()) {

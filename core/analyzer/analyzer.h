@@ -30,6 +30,8 @@ class CAnalyzer : public TransactionSink {
   // Queues item; the analyzer owns its transaction from then on. False when the queue refused
   // it (the transaction is then deleted) or did not exist (the transaction stays the caller's).
   bool add(_TYPED_TRANSACTION item) override;
+  // The same for a batch, put in with one lock per stretch of room.
+  bool addBatch(const _TYPED_TRANSACTION* items, size_t n) override;
 
   // Asks the analyzer thread to finish. Besides setting the flag its loop polls, it queues an
   // empty item so that a thread waiting on an idle queue notices at once.

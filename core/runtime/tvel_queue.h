@@ -105,6 +105,38 @@ class TvelQueue {
     }
   }
 
+  // Copies items[0..n) in, in order, waiting whenever the queue is full as Put does, and
+  // filling what room there is under one lock with one wake-up of the consumer: 0, or an event
+  // or mutex status with *stored (when not null) the number that went in before it.
+  long PutBatch(const T* items, unsigned long n, unsigned long* stored = nullptr) {
+    unsigned long done = 0;
+    long status = cvel::kOk;
+    while (done < n && status == cvel::kOk) {
+      status = v_notfull.Wait();
+      if (status != cvel::kOk) {
+        break;
+      }
+      CvelMutexLock lock(v_queuemutex);
+      unsigned long count = v_numofitems.load();
+      if (count == v_currentmaxitem) {
+        continue;
+      }
+      for (; done < n && count < v_currentmaxitem; ++done, ++count) {
+        v_tail = static_cast<long>((static_cast<unsigned long>(v_tail + 1)) % v_currentmaxitem);
+        v_items[v_tail] = items[done];
+      }
+      v_numofitems.store(count);
+      status = v_notempty.Signal();
+      if (count == v_currentmaxitem && status == cvel::kOk) {
+        status = v_notfull.Reset();
+      }
+    }
+    if (stored != nullptr) {
+      *stored = done;
+    }
+    return status;
+  }
+
   // Takes up to max of the oldest items into out[0..) in order, waiting as Get does: the count
   // taken (at least 1; 0 only when max is 0), or Get's status when nothing was (statuses are
   // negative). One lock and

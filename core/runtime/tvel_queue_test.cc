@@ -116,6 +116,37 @@ TEST(TvelQueueTest, GetBatchTakesWhatGetWould) {
   EXPECT_EQ(0, queue.GetBatch(out, 0, 10));
 }
 
+// Batches put in what single Puts would, in order, waiting for room as often as they must:
+// a consumer taking random batches sees every item once, in order.
+TEST(TvelQueueTest, PutBatchStoresWhatPutWould) {
+  Queue queue(7);
+  constexpr uint32_t kItems = 5000;
+  std::thread consumer([&queue] {
+    std::srand(5);
+    _TYPED_TRANSACTION out[9];
+    uint32_t expected = 0;
+    while (expected < kItems) {
+      const long taken = queue.GetBatch(out, 1 + std::rand() % 9, 1000);
+      ASSERT_GT(taken, 0);
+      for (long i = 0; i < taken; ++i) {
+        ASSERT_EQ(expected++, out[i].type);
+      }
+    }
+  });
+  std::vector<_TYPED_TRANSACTION> items;
+  for (uint32_t next = 0; next < kItems;) {
+    items.clear();
+    for (int n = 1 + std::rand() % 20; n > 0 && next < kItems; --n) {
+      items.push_back(Item(next++));
+    }
+    unsigned long stored = 0;
+    ASSERT_EQ(cvel::kOk, queue.PutBatch(items.data(), items.size(), &stored));
+    ASSERT_EQ(items.size(), stored);
+  }
+  consumer.join();
+  EXPECT_TRUE(queue.IsEmpty());
+}
+
 // Get on an empty queue gives the timeout code and leaves the item alone.
 TEST(TvelQueueTest, GetOnEmptyQueueTimesOut) {
   Queue queue;

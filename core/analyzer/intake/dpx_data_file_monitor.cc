@@ -28,11 +28,15 @@ class CDPXDataFileMonitor::RecordHandler : public CSM3RecordSink {
  public:
   RecordHandler(TransactionSink& sink, int excludeOutlierMillis)
       : sink(sink), excludeOutlierMillis(excludeOutlierMillis) {}
+  ~RecordHandler() override { flush(); }
+  RecordHandler(const RecordHandler&) = delete;
+  RecordHandler& operator=(const RecordHandler&) = delete;
 
   bool processSM3Line(char* line, int recordType) override {
     // Stop the pass here: this record and the rest of the chunk are not consumed, so the
     // persisted offset makes the next start read them.
     if (sink.isShutdownRequested()) {
+      flush();  // what this pass took before goes in: its bytes count as consumed
       refused = true;
       return false;
     }
@@ -51,13 +55,27 @@ class CDPXDataFileMonitor::RecordHandler : public CSM3RecordSink {
     // The parsed record is already a transaction of its own; queue it without a copy.
     transaction->setRecordType(recordType);
     doUUIDs(*transaction, &previousPage, &instanceCounter, &pageSeen);
-    sink.add(_TYPED_TRANSACTION{TRANSACTION_KIND_DPX, transaction.release()});
+    pending[pendingCount++] = _TYPED_TRANSACTION{TRANSACTION_KIND_DPX, transaction.release()};
+    if (pendingCount == kBatch) {
+      flush();
+    }
     return true;
+  }
+  // Hands the records taken so far to the sink in one batch. Called when the batch is full and
+  // at the end of every pass, so no record waits past the pass that read it.
+  void flush() {
+    if (pendingCount > 0) {
+      sink.addBatch(pending, pendingCount);
+      pendingCount = 0;
+    }
   }
   bool wasRefused() const { return refused; }
 
  private:
+  static constexpr size_t kBatch = 32;
   TransactionSink& sink;
+  _TYPED_TRANSACTION pending[kBatch];
+  size_t pendingCount = 0;
   bool refused = false;  // a record was refused: the sink is shutting down
   const int excludeOutlierMillis;
   CUUID previousPage;  // all zero until the first page
@@ -197,6 +215,7 @@ void CDPXDataFileMonitor::Run() {
                     getLastProcessedOffset(), end);
         const long consumed =
             processDPXContents(chunk.get(), length, length == MAX_BUFFER, handler);
+        handler.flush();
         if (consumed != length) {
           CLOG::med("only processed %u of %u bytes!", static_cast<unsigned>(consumed),
                     static_cast<unsigned>(length));

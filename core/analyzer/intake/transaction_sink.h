@@ -8,6 +8,7 @@
 // Threads: a sink is called from intake threads and must be safe for that; a feeder's start
 // and shutdownAndJoin come from the thread that owns it.
 
+#include <cstddef>
 #include <cstdint>
 
 #include "core/analyzer/intake/intake_counters.h"
@@ -23,6 +24,15 @@ class TransactionSink {
   // Queues item; the sink owns its transaction from then on. False when the sink refused it
   // (the transaction is then deleted) or had no queue (the transaction stays the caller's).
   virtual bool add(_TYPED_TRANSACTION item) = 0;
+  // Queues items[0..n) in order, as that many adds would; false when any was refused. Sinks
+  // with a queue override it to take the batch in one hand-off.
+  virtual bool addBatch(const _TYPED_TRANSACTION* items, size_t n) {
+    bool all = true;
+    for (size_t i = 0; i < n; ++i) {
+      all = add(items[i]) && all;
+    }
+    return all;
+  }
   // True once the sink is shutting down: readers stop taking records.
   virtual bool isShutdownRequested() const = 0;
   // What the readers count as they go (records read, unparsed, dropped; file and offset).
