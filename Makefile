@@ -88,6 +88,7 @@ bench: deps
 	cmake -S . -B build-release $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Release -DQ7_BUILD_TESTS=OFF
 	cmake --build build-release -j $(JOBS)
 	@for b in build-release/bin/bench_*; do [ -x "$$b" ] && "$$b"; done; true
+	bench/q7bench_series.sh build-release/bin/bench_q7bench 5
 
 FUZZ_SECONDS ?= 60
 FUZZ_TARGETS := sm3_fuzz http_parser_fuzz capture_fuzz
