@@ -2,6 +2,10 @@
 
 #include <cstring>
 
+#if defined(__SSE2__)
+#include <emmintrin.h>
+#endif
+
 #include "core/analyzer/intake/common.h"
 #include "core/analyzer/intake/sm3_fields.h"
 #include "core/runtime/clog.h"
@@ -25,33 +29,32 @@ int32_t FieldInteger(const char* start, size_t length) {
 namespace sm3_internal {
 
 int FindCarets(const char* line, const char** carets, int capacity) {
-  // Eight bytes at a time, as countCarets counts: a byte of x is zero exactly where the line
-  // holds a caret, and the expression sets the top bit of exactly those bytes.
-  constexpr uint64_t kOnes7 = 0x7F7F7F7F7F7F7F7FULL;
-  constexpr uint64_t kCarets = 0x5E5E5E5E5E5E5E5EULL;
+  // Sixteen bytes at a time (SSE2, which every x86-64 has): one compare and one mask per block,
+  // then a step per caret found.
   static_assert(CARET == 0x5E);
   const size_t length = strlen(line);
   int count = 0;
+  const auto note = [&](size_t at) {
+    if (count < capacity) {
+      carets[count] = line + at;
+    }
+    ++count;
+  };
   size_t i = 0;
-  for (; i + 8 <= length; i += 8) {
-    uint64_t word;
-    memcpy(&word, line + i, sizeof(word));
-    const uint64_t x = word ^ kCarets;
-    uint64_t tops = ~(((x & kOnes7) + kOnes7) | x | kOnes7);
-    while (tops != 0) {
-      if (count < capacity) {
-        carets[count] = line + i + static_cast<size_t>(__builtin_ctzll(tops)) / 8;
-      }
-      ++count;
-      tops &= tops - 1;
+#if defined(__SSE2__)
+  const __m128i caret = _mm_set1_epi8(CARET);
+  for (; i + 16 <= length; i += 16) {
+    const __m128i block = _mm_loadu_si128(reinterpret_cast<const __m128i*>(line + i));
+    unsigned mask = static_cast<unsigned>(_mm_movemask_epi8(_mm_cmpeq_epi8(block, caret)));
+    while (mask != 0) {
+      note(i + static_cast<size_t>(__builtin_ctz(mask)));
+      mask &= mask - 1;
     }
   }
+#endif
   for (; i < length; ++i) {
     if (line[i] == CARET) {
-      if (count < capacity) {
-        carets[count] = line + i;
-      }
-      ++count;
+      note(i);
     }
   }
   return count;
