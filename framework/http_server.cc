@@ -124,20 +124,19 @@ void ServeSample(const httplib::Request& req, httplib::Response& res) {
     return;
   }
 
+  // The limit goes into the sample itself, so that no row past it is copied or written.
   Sample sample;
-  const int status = SampleTable(table->name, std::move(conditions), &sample, &error);
+  const int status =
+      SampleTable(table->name, std::move(conditions), &sample, &error, limit.value_or(kNoRowLimit));
   if (status != kOk) {
     ReplyError(res, status == kNotFound ? 404 : 500, error);
     return;
-  }
-  if (limit.has_value()) {
-    sample.Truncate(*limit);
   }
   if (format == SampleFormat::kCsv) {
     res.status = 200;
     res.set_content(SampleToCsv(sample), "text/csv");
   } else {
-    ReplyJson(res, 200, SampleToJson(sample));
+    ReplyJsonText(res, 200, SampleToJsonText(sample));
   }
 }
 

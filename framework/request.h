@@ -32,10 +32,15 @@ struct Condition {
   int value_length = -1;
 };
 
+inline constexpr std::size_t kNoRowLimit = static_cast<std::size_t>(-1);
+
 struct Request {
   int type = 0;                          // framework request type (3 sample, 4 situation)
   std::optional<std::string> situation;  // the situation's name; absent for plain samples
   std::vector<Condition> conditions;     // all must hold for a row to qualify
+  // The framework keeps at most this many rows, the first that qualify; so without conditions
+  // an agent object may stop once it has handed over this many.
+  std::size_t row_limit = kNoRowLimit;
 
   // Rows handed over by the agent object, back to back in the order added. row_size is 0
   // until the first rows arrive; every later batch must have the same row size.

@@ -45,27 +45,6 @@ std::string_view ConditionValue(const Condition& condition) {
 
 }  // namespace
 
-bool IsTextColumn(const ColumnInfo& column) {
-  return column.type == kColumnTypeString || column.type == kColumnTypeLongText;
-}
-
-std::string_view ColumnText(const void* row, const ColumnInfo& column) {
-  const char* text = static_cast<const char*>(row) + column.offset;
-  return WithoutTrailingPadding({text, strnlen(text, static_cast<std::size_t>(column.width))});
-}
-
-std::int32_t ColumnInteger(const void* row, const ColumnInfo& column) {
-  const char* at = static_cast<const char*>(row) + column.offset;
-  if (column.type == kColumnTypeInt16) {
-    std::int16_t value = 0;
-    std::memcpy(&value, at, sizeof(value));
-    return value;
-  }
-  std::int32_t value = 0;
-  std::memcpy(&value, at, sizeof(value));
-  return value;
-}
-
 bool RowFailsCondition(const void* row, const ColumnInfo& column, const Condition& condition) {
   const std::string_view value = WithoutTrailingPadding(ConditionValue(condition));
   if (IsTextColumn(column)) {

@@ -6,6 +6,7 @@
 // Thread safety: pure functions of their arguments.
 
 #include <cstdint>
+#include <cstring>
 #include <string_view>
 
 #include "framework/request.h"
@@ -13,15 +14,36 @@
 
 namespace fw {
 
+// Inline, these three: writing a sample's answer calls them for every value.
+
 // True for the string and long-text types.
-bool IsTextColumn(const ColumnInfo& column);
+inline bool IsTextColumn(const ColumnInfo& column) {
+  return column.type == kColumnTypeString || column.type == kColumnTypeLongText;
+}
 
 // A text column's value without its padding: up to the first NUL within the width, trailing
 // blanks dropped. The view points into *row.
-std::string_view ColumnText(const void* row, const ColumnInfo& column);
+inline std::string_view ColumnText(const void* row, const ColumnInfo& column) {
+  const char* text = static_cast<const char*>(row) + column.offset;
+  std::size_t size = strnlen(text, static_cast<std::size_t>(column.width));
+  while (size > 0 && text[size - 1] == ' ') {
+    --size;
+  }
+  return {text, size};
+}
 
 // An integer column's value (a 16-bit column widened).
-std::int32_t ColumnInteger(const void* row, const ColumnInfo& column);
+inline std::int32_t ColumnInteger(const void* row, const ColumnInfo& column) {
+  const char* at = static_cast<const char*>(row) + column.offset;
+  if (column.type == kColumnTypeInt16) {
+    std::int16_t value = 0;
+    std::memcpy(&value, at, sizeof(value));
+    return value;
+  }
+  std::int32_t value = 0;
+  std::memcpy(&value, at, sizeof(value));
+  return value;
+}
 
 // True when the row's column does NOT satisfy the condition (the row is an exception to it).
 // Text compares byte-wise without padding on either side; integers compare numerically, and an

@@ -1,10 +1,13 @@
 #include "framework/sample_query.h"
 
+#include <algorithm>
 #include <array>
 #include <cctype>
 #include <charconv>
 #include <cstdint>
+#include <cstring>
 #include <utility>
+#include <vector>
 
 #include "framework/row_filter.h"
 #include "framework/status.h"
@@ -38,6 +41,81 @@ std::string CsvField(std::string_view text) {
   }
   quoted += '"';
   return quoted;
+}
+
+using Json = nlohmann::ordered_json;
+
+// A string as dump() writes it: quoted, escaped, invalid UTF-8 replaced.
+std::string DumpedString(std::string_view text) {
+  return Json(std::string(text)).dump(-1, ' ', false, Json::error_handler_t::replace);
+}
+
+// The bytes dump() copies unchanged: printable ASCII except the quote and the backslash.
+constexpr std::array<bool, 256> kPlainJsonByte = [] {
+  std::array<bool, 256> plain{};
+  for (int c = 0x20; c < 0x80; ++c) {
+    plain[c] = c != '"' && c != '\\';
+  }
+  return plain;
+}();
+
+bool IsPlainJsonText(std::string_view text) {
+  return std::all_of(text.begin(), text.end(),
+                     [](char c) { return kPlainJsonByte[static_cast<unsigned char>(c)]; });
+}
+
+// Text written through a pointer into room reserved ahead, since checking capacity per
+// character would cost more than writing it. It holds one row of an answer at a time: written
+// here in cache, then appended, the answer's megabytes are written to memory once.
+class TextBuffer {
+ public:
+  // Room for n more bytes; valid until the next Reserve.
+  char* Reserve(std::size_t n) {
+    if (text_.size() - used_ < n) {
+      text_.resize(std::max(text_.size() * 2, used_ + n));
+    }
+    return text_.data() + used_;
+  }
+  // Marks the text up to end (within the last Reserve) as written.
+  void Commit(const char* end) { used_ = static_cast<std::size_t>(end - text_.data()); }
+  std::string_view text() const { return {text_.data(), used_}; }
+  void Clear() { used_ = 0; }
+
+ private:
+  std::string text_;
+  std::size_t used_ = 0;
+};
+
+char* Put(char* at, std::string_view text) {
+  std::memcpy(at, text.data(), text.size());
+  return at + text.size();
+}
+
+// Room a row's writing may overrun by: short pieces are copied in whole blocks of this size.
+constexpr std::size_t kBlock = 32;
+
+// A piece of at most kBlock bytes kept in a block of its own, so that copying it is two moves
+// rather than a call (the writer leaves kBlock bytes of room past what it writes).
+struct ShortText {
+  char bytes[kBlock] = {};
+  std::size_t size = 0;
+};
+
+char* Put(char* at, const ShortText& text) {
+  std::memcpy(at, text.bytes, kBlock);
+  return at + text.size;
+}
+
+// How one member of a row object is written: the text before its value, and where the value is.
+struct MemberPlan {
+  std::string prefix;      // ",\n" or "\n" (the first), indent, quoted name, ": "
+  ShortText short_prefix;  // the same when it fits a block
+  const ColumnInfo* column;
+  bool text;
+};
+
+char* PutPrefix(char* at, const MemberPlan& member) {
+  return member.short_prefix.size != 0 ? Put(at, member.short_prefix) : Put(at, member.prefix);
 }
 
 }  // namespace
@@ -114,6 +192,83 @@ nlohmann::ordered_json SampleToJson(const Sample& sample) {
   body["table"] = sample.table->name;
   body["rows"] = std::move(rows);
   return body;
+}
+
+std::string SampleToJsonText(const Sample& sample) {
+  // One member per distinct column name, placed where the name first appears and holding the
+  // last such column's value: what assigning every column into an ordered object leaves.
+  std::vector<MemberPlan> members;
+  for (const ColumnInfo& column : sample.table->columns) {
+    const std::string_view name = column.name;
+    auto same = std::find_if(members.begin(), members.end(),
+                             [&](const MemberPlan& m) { return m.column->name == name; });
+    if (same != members.end()) {
+      same->column = &column;
+      same->text = IsTextColumn(column);
+    } else {
+      members.push_back({"      " + DumpedString(name) + ": ", {}, &column, IsTextColumn(column)});
+    }
+  }
+  // A row's text when every value takes the plain path, and the overrun room; anything longer
+  // reserves again.
+  std::size_t row_bound = 16 + kBlock;
+  for (std::size_t m = 0; m < members.size(); ++m) {
+    MemberPlan& member = members[m];
+    member.prefix.insert(0, m == 0 ? "\n" : ",\n");
+    if (member.prefix.size() <= kBlock) {
+      std::memcpy(member.short_prefix.bytes, member.prefix.data(), member.prefix.size());
+      member.short_prefix.size = member.prefix.size();
+    }
+    row_bound += member.prefix.size() +
+                 (member.text ? static_cast<std::size_t>(member.column->width) + 2 : 11);
+  }
+
+  std::string out = "{\n  \"table\": " + DumpedString(sample.table->name) + ",\n  \"rows\": ";
+  const int count = sample.row_count();
+  if (count == 0) {
+    return out + "[]\n}\n";
+  }
+  out += "[\n";
+  TextBuffer row_text;
+  for (int i = 0; i < count; ++i) {
+    const char* row = static_cast<const char*>(sample.row(i));
+    char* at = row_text.Reserve(row_bound);
+    at = Put(at, i == 0 ? std::string_view("    {") : std::string_view(",\n    {"));
+    if (members.empty()) {
+      at = Put(at, "}");
+    }
+    for (const MemberPlan& member : members) {
+      at = PutPrefix(at, member);
+      const ColumnInfo& column = *member.column;
+      if (!member.text) {
+        at = std::to_chars(at, at + 11, ColumnInteger(row, column)).ptr;
+        continue;
+      }
+      const std::string_view text = ColumnText(row, column);
+      if (IsPlainJsonText(text)) {
+        *at++ = '"';
+        at = Put(at, text);
+        *at++ = '"';
+        continue;
+      }
+      const std::string dumped = DumpedString(text);
+      row_text.Commit(at);
+      at = Put(row_text.Reserve(dumped.size() + row_bound), dumped);
+    }
+    if (!members.empty()) {
+      at = Put(at, "\n    }");
+    }
+    row_text.Commit(at);
+    if (i == 0) {
+      // Rows are alike in size: the first tells how much the rest will take.
+      out.reserve(out.size() + row_text.text().size() * static_cast<std::size_t>(count) * 9 / 8 +
+                  16);
+    }
+    out += row_text.text();
+    row_text.Clear();
+  }
+  out += "\n  ]\n}\n";
+  return out;
 }
 
 std::string SampleToCsv(const Sample& sample) {

@@ -26,7 +26,7 @@ void Sample::Truncate(std::size_t count) {
 }
 
 int SampleTable(std::string_view table, std::vector<Condition> conditions, Sample* sample,
-                std::string* error) {
+                std::string* error, std::size_t limit) {
   std::shared_ptr<const TableDefinition> definition = FindTable(table);
   if (definition == nullptr) {
     *error = "no table named " + std::string(table);
@@ -46,6 +46,7 @@ int SampleTable(std::string_view table, std::vector<Condition> conditions, Sampl
   Request request;
   request.type = kSampleRequestType;
   request.conditions = conditions;
+  request.row_limit = limit;
   {
     std::unique_ptr<TableAgent> agent = definition->manager->CreateAgent(&request);
     if (agent == nullptr) {
@@ -68,16 +69,22 @@ int SampleTable(std::string_view table, std::vector<Condition> conditions, Sampl
   sample->rows.clear();
   const std::size_t size = definition->row_size;
   const int count = request.row_count();
-  for (int i = 0; i < count; ++i) {
-    const std::byte* row = request.rows.data() + static_cast<std::size_t>(i) * size;
-    const bool qualifies = std::none_of(resolved.begin(), resolved.end(), [&](const auto& r) {
-      return RowFailsCondition(row, *r.column, *r.condition);
-    });
-    if (qualifies) {
-      sample->rows.insert(sample->rows.end(), row, row + size);
+  if (resolved.empty()) {
+    // Every row qualifies: the request's rows become the sample's, not a copy of them.
+    sample->rows = std::move(request.rows);
+    sample->Truncate(limit);
+  } else {
+    for (int i = 0; i < count && static_cast<std::size_t>(sample->row_count()) < limit; ++i) {
+      const std::byte* row = request.rows.data() + static_cast<std::size_t>(i) * size;
+      const bool qualifies = std::none_of(resolved.begin(), resolved.end(), [&](const auto& r) {
+        return RowFailsCondition(row, *r.column, *r.condition);
+      });
+      if (qualifies) {
+        sample->rows.insert(sample->rows.end(), row, row + size);
+      }
     }
   }
-  Q7_TRACE(kUnit, kTraceDetail, "%s sampled: %d rows, %d qualify", definition->name.c_str(), count,
+  Q7_TRACE(kUnit, kTraceDetail, "%s sampled: %d rows, %d kept", definition->name.c_str(), count,
            sample->row_count());
   return kOk;
 }

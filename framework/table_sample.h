@@ -40,11 +40,11 @@ struct Sample {
 };
 
 // Takes one sample of the table named table (any case) and keeps the rows for which every
-// condition holds. Returns kOk and fills *sample; kNotFound when no such table is registered;
-// kInvalidArgument when a condition names a column the table does not have, the manager made
-// no agent object, or the agent object handed over rows of another size than the table's. *error
-// says why on failure.
+// condition holds, the first limit of them at most. Returns kOk and fills *sample; kNotFound when
+// no such table is registered; kInvalidArgument when a condition names a column the table does not
+// have, the manager made no agent object, or the agent object handed over rows of another size than
+// the table's. *error says why on failure.
 int SampleTable(std::string_view table, std::vector<Condition> conditions, Sample* sample,
-                std::string* error);
+                std::string* error, std::size_t limit = kNoRowLimit);
 
 }  // namespace fw

@@ -10,8 +10,10 @@
 #include <cstddef>
 #include <cstdint>
 #include <cstring>
+#include <limits>
 #include <memory>
 #include <nlohmann/json.hpp>
+#include <random>
 #include <string>
 #include <tuple>
 #include <utility>
@@ -57,6 +59,7 @@ struct FakeState {
   std::vector<std::string> calls;
   int request_type = 0;
   std::size_t request_conditions = 0;
+  std::size_t request_row_limit = 0;
 };
 FakeState fake;
 
@@ -68,6 +71,7 @@ class FakeAgent : public TableAgent {
     fake.calls.push_back("sample");
     fake.request_type = request_->type;
     fake.request_conditions = request_->conditions.size();
+    fake.request_row_limit = request_->row_limit;
     // Would deadlock if the sample held the registry's lock.
     FindTable("FAKE");
     AddRows(request_, fake.rows.data(), fake.row_size, static_cast<int>(fake.rows.size()));
@@ -188,6 +192,81 @@ TEST_F(TableSampleTest, JsonDecodesRowsThroughTheColumns) {
             body.dump());
   sample.Truncate(0);
   EXPECT_EQ(R"({"table":"FAKE","rows":[]})", SampleToJson(sample).dump());
+}
+
+// The answer written straight from the rows is the document tree's dump, byte for byte: random
+// rows whose text needs escaping, holds UTF-8 (valid, cut short or invalid), or is padded, and
+// a column name given twice (the later column's value, at the first's place).
+TEST(SampleJsonTextTest, IsTheDocumentDumped) {
+  struct Wide {
+    char name[9];
+    std::int16_t delta;
+    char note[24];
+    std::int32_t count;
+    char tail[5];
+  };
+  auto table = std::make_shared<TableDefinition>();
+  table->name = "WIDE \"x\"";
+  table->columns = {{"name", kColumnTypeString, 9, Offset(offsetof(Wide, name))},
+                    {"delta", kColumnTypeInt16, 2, Offset(offsetof(Wide, delta))},
+                    {"note", kColumnTypeLongText, 24, Offset(offsetof(Wide, note))},
+                    {"count", kColumnTypeInt32, 4, Offset(offsetof(Wide, count))},
+                    {"name", kColumnTypeString, 5, Offset(offsetof(Wide, tail))}};
+  table->row_size = sizeof(Wide);
+  const std::vector<std::string> pieces = {
+      "a",    "Z",    " ",        "\"",       "\\",           "\n",
+      "\t",   "\x01", "\x7f",     "\xc3\xa9", "\xe2\x82\xac", "\xf0\x9f\x98\x80",
+      "\x80", "\xc3", "\xe2\x82", "\xff",     "\xed\xa0\x80", std::string(1, '\0')};
+  std::mt19937 rng(1);
+  auto fill = [&](char* field, std::size_t width) {
+    std::string text;
+    for (int n = static_cast<int>(rng() % 8); n > 0; --n) {
+      text += pieces[rng() % pieces.size()];
+    }
+    text.resize(std::min(text.size(), width));
+    std::memset(field, rng() % 2 == 0 ? '\0' : ' ', width);
+    std::memcpy(field, text.data(), text.size());
+  };
+  for (int round = 0; round < 500; ++round) {
+    Sample sample;
+    sample.table = table;
+    for (int r = static_cast<int>(rng() % 4); r > 0; --r) {
+      Wide row;
+      std::memset(&row, 0, sizeof(row));
+      fill(row.name, sizeof(row.name));
+      fill(row.note, sizeof(row.note));
+      fill(row.tail, sizeof(row.tail));
+      row.delta = static_cast<std::int16_t>(rng());
+      row.count = rng() % 5 == 0 ? std::numeric_limits<std::int32_t>::min()
+                                 : static_cast<std::int32_t>(rng());
+      const auto* bytes = reinterpret_cast<const std::byte*>(&row);
+      sample.rows.insert(sample.rows.end(), bytes, bytes + sizeof(row));
+    }
+    const std::string want =
+        SampleToJson(sample).dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace) +
+        "\n";
+    ASSERT_EQ(want, SampleToJsonText(sample)) << "round " << round;
+  }
+}
+
+// A limit keeps the first rows that qualify, the same rows as cutting the whole sample, and the
+// agent object is told it.
+TEST_F(TableSampleTest, LimitKeepsTheFirstQualifyingRows) {
+  const std::vector<std::vector<Condition>> filters = {
+      {}, {{"name", Op::kEQ, "Shop", -1}}, {{"count", Op::kGE, "0", -1}}};
+  for (const auto& conditions : filters) {
+    Sample whole;
+    std::string error;
+    ASSERT_EQ(kOk, SampleTable("FAKE", conditions, &whole, &error)) << error;
+    for (std::size_t limit = 0; limit <= 5; ++limit) {
+      Sample limited;
+      ASSERT_EQ(kOk, SampleTable("FAKE", conditions, &limited, &error, limit)) << error;
+      Sample cut = whole;
+      cut.Truncate(limit);
+      EXPECT_EQ(cut.rows, limited.rows) << conditions.size() << " conditions, limit " << limit;
+      EXPECT_EQ(limit, fake.request_row_limit);
+    }
+  }
 }
 
 TEST_F(TableSampleTest, CsvQuotesWhatNeedsIt) {

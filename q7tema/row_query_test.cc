@@ -86,6 +86,27 @@ TEST_F(RowQueryTest, NoRowsWithoutAnArrayOrAQuery) {
   EXPECT_EQ(0, request_.row_count());
 }
 
+// A query that takes a limit hears the request's only when no condition is left for the
+// framework to apply afterwards; read back as a plain query, it is asked for every row.
+TEST_F(RowQueryTest, LimitReachesTheQueryOnlyWithoutConditions) {
+  std::vector<std::size_t> limits;
+  SetLimitedRowQuery<Row>([&limits](int, std::size_t limit, int* count) {
+    limits.push_back(limit);
+    *count = 1;
+    return new Row[1]{};
+  });
+  request_ = fw::Request{};
+  request_.type = 3;
+  request_.row_limit = 5;
+  manager_.CreateAgent(&request_)->TakeSample();
+  request_.conditions = {{"applicatin", fw::ConditionOp::kEQ, "Shop", -1}};
+  manager_.CreateAgent(&request_)->TakeSample();
+  int count = 0;
+  std::unique_ptr<Row[]>(RowQueryFor<Row>()(3, &count));
+  EXPECT_EQ((std::vector<std::size_t>{5, fw::kNoRowLimit, fw::kNoRowLimit}), limits);
+  EXPECT_EQ(2, request_.row_count());
+}
+
 // A type-1 request's conditions are traced by column; OATIME and PCGOOD also by value.
 TEST_F(RowQueryTest, TypeOneConstructorTracesTheConditions) {
   fw::TraceCapture capture("tables=DETAIL");

@@ -59,14 +59,18 @@ class TableAgent : public TableBase<Row> {
 
   // Hands over the rows of the query registered for Row (SetRowQuery); none without one.
   void TakeSample() override {
-    const RowQuery<Row> query = RowQueryFor<Row>();
+    const LimitedRowQuery<Row> query = LimitedRowQueryFor<Row>();
     if (!query) {
       Q7_TRACE("tables", fw::kTraceDetail, "%s: no row query, no rows",
                std::string(Layout::kName).c_str());
       return;
     }
+    // The framework filters after the query, so only without conditions are the query's first
+    // rows the ones kept.
+    const fw::Request& request = *this->request();
+    const std::size_t limit = request.conditions.empty() ? request.row_limit : fw::kNoRowLimit;
     int count = 0;
-    const std::unique_ptr<Row[]> rows(query(this->request()->type, &count));
+    const std::unique_ptr<Row[]> rows(query(request.type, limit, &count));
     const int added = rows != nullptr && count >= 1 ? count : 0;
     if (added > 0) {
       this->AddData(rows.get(), added);

@@ -1,3 +1,4 @@
+#include <cstddef>
 #include <nlohmann/json.hpp>
 
 #include "core/analyzer/dpx_analyzer.h"
@@ -24,7 +25,11 @@ void installRowQueries() {
 #define Q7_ROW_QUERY_EXPORTED(name) Q7_ROW_QUERY(name)
 #define Q7_ROW_QUERY_HISTORY_ONLY(name)
 #define Q7_OVER_TIME_QUERY(name, Row, keys, Tree, EXPORT) Q7_ROW_QUERY_##EXPORT(name)
-#define Q7_SUMMARY_QUERY(name, Row, keys, overTime) Q7_ROW_QUERY(name)
+#define Q7_SUMMARY_QUERY(name, Row, keys, overTime)                                         \
+  q7tema::SetLimitedRowQuery<kq7_q7##name##_data_t>(                                        \
+      [](int sampleType, std::size_t limit, int* count) {                                   \
+        return CDPXAnalyzer::GetInstanceNoStart()->get_tbl##name(sampleType, count, limit); \
+      });
 #define Q7_CURRENT_QUERY(name, overTime, COLUMNS) Q7_ROW_QUERY(name)
   Q7_ANALYZER_TABLES(Q7_OVER_TIME_QUERY, Q7_SUMMARY_QUERY, Q7_CURRENT_QUERY, Q7_ROW_QUERY)
 #undef Q7_CURRENT_QUERY

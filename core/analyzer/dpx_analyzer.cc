@@ -7,6 +7,7 @@
 #include <string>
 #include <thread>
 
+#include "core/analyzer/analysis/summary_fold.h"
 #include "core/analyzer/intake/dpx_file_manager.h"
 #include "core/analyzer/intake/dpx_transaction.h"
 #include "core/analyzer/situation_controller.h"
@@ -71,7 +72,8 @@ CDPXAnalyzer::CDPXAnalyzer(Paths p)
       instanceFile(std::make_unique<history::InstanceFile>(paths.historyDirectory, "q7txins",
                                                            sizeof(kq7_q7txins_data_t))),
       subInstanceFile(std::make_unique<history::InstanceFile>(paths.historyDirectory, "q7subtxins",
-                                                              sizeof(kq7_q7subtxins_data_t))) {
+                                                              sizeof(kq7_q7subtxins_data_t))),
+      summaryFolds(std::make_unique<SummaryFolds>()) {
   state->load();
 }
 
@@ -115,6 +117,8 @@ void CDPXAnalyzer::rollover() {
   transactionsReceived = 0;
   const long ended = getCurrentOverTimeInterval();
   saveIntervalData(ended);
+  // The saved interval joins every summary's history: the folds kept are stale, so free them.
+  summaryFolds->clear();
   updateCurrentOverTimeInterval();
   auto fresh = std::make_unique<COverTimeTrees>();
   if (CConfig::getReportZeroRecords()) {

@@ -12,6 +12,7 @@
 // points) guards the trees, the cache state and the instance files.
 
 #include <atomic>
+#include <cstddef>
 #include <functional>
 #include <memory>
 
@@ -25,6 +26,9 @@
 
 class CDPXTransaction;
 struct InstancePatterns;
+struct SummaryFolds;
+template <class SummaryRow>
+class SummaryFoldCache;
 namespace history {
 class HistoryStore;
 class InstanceFile;
@@ -64,7 +68,8 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // ---- Table queries (table_queries.cc). Each returns a new[] array of table rows the caller
   // releases with delete[], and their count through count (null with 0). Only sample type 3
   // yields rows. The public ones take the tree lock, flush the cache and stamp sampletime; the
-  // inner ones (i_get_tbl...) run with the lock held. ----
+  // inner ones (i_get_tbl...) run with the lock held. A summary query answers only the first
+  // limit rows when given one. ----
 #define Q7_DECLARE_OVER_TIME_QUERY(name, Row, keys, Tree, EXPORT)                      \
   kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count);                    \
   kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count, bool currentOnly) \
@@ -72,7 +77,9 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
 #define Q7_DECLARE_QUERY(name)                                      \
   kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count); \
   kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count) REQUIRES(treeMutex);
-#define Q7_DECLARE_SUMMARY_QUERY(name, Row, keys, overTime) Q7_DECLARE_QUERY(name)
+#define Q7_DECLARE_SUMMARY_QUERY(name, Row, keys, overTime)        \
+  kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count, \
+                                       std::size_t limit = static_cast<std::size_t>(-1));
   // Current-status rows: the current interval's over-time rows without aggby.
 #define Q7_DECLARE_CURRENT_QUERY(name, overTime, COLUMNS) \
   kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count);
@@ -126,6 +133,13 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
       REQUIRES(treeMutex);
   template <class Layout, class Inner>
   Layout* lockedQuery(Inner inner, int* count) EXCLUDES(treeMutex);
+  // A summary query: the current interval's rows of its over-time table merged into the fold
+  // of that table's history (stem), which folds keeps between queries.
+  template <class SummaryRow>
+  typename SummaryRow::LayoutType* summaryQuery(const char* stem,
+                                                SummaryFoldCache<SummaryRow>& folds,
+                                                const char* where, int sampleType, int* count,
+                                                std::size_t limit) EXCLUDES(treeMutex);
   void saveIntervalData(long interval) REQUIRES(treeMutex);
   void saveAllData(long interval) REQUIRES(treeMutex);
   void cleanupOldFiles();
@@ -141,6 +155,8 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   std::unique_ptr<IntervalCache> cache PT_GUARDED_BY(treeMutex);  // the trees, and the cache
   std::unique_ptr<history::InstanceFile> instanceFile PT_GUARDED_BY(treeMutex);
   std::unique_ptr<history::InstanceFile> subInstanceFile PT_GUARDED_BY(treeMutex);
+  // Each summary's history fold, kept between queries; locks itself.
+  const std::unique_ptr<SummaryFolds> summaryFolds;
   // The interval transactions are judged against. Written by the analyzer thread under the
   // tree lock, read by it without: an atomic, since nothing else reads it.
   std::atomic<long> referenceInterval{0};

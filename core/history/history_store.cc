@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <cstring>
 #include <filesystem>
@@ -85,7 +86,18 @@ bool ValidWalk(int intervals, int64_t interval_seconds, size_t record_size, cons
   return intervals > 0;
 }
 
+std::atomic<uint64_t> g_generation{0};
+
+// Called once a change is in place, so that a reader seeing the new value reads the change.
+void Advance() {
+  g_generation.fetch_add(1, std::memory_order_release);
+}
+
 }  // namespace
+
+uint64_t HistoryStore::generation() {
+  return g_generation.load(std::memory_order_acquire);
+}
 
 HistoryStore::HistoryStore(std::string directory) : directory_(std::move(directory)) {
   while (directory_.size() > 1 && directory_.back() == '/') {
@@ -121,6 +133,7 @@ bool HistoryStore::saveIntervalInPieces(int64_t interval, std::string_view stem,
       CLOG::error("%s cannot remove %s: %s", kWhere, path.c_str(), std::strerror(errno));
       return false;
     }
+    Advance();
     return true;
   }
   // A fixed temporary name, so that cleanup recognises what a crash left behind.
@@ -139,9 +152,11 @@ bool HistoryStore::saveIntervalInPieces(int64_t interval, std::string_view stem,
     return true;
   };
   if (fw::ReplaceFileInPieces(path, produce, options) != fw::kOk) {
+    Advance();  // a failure late in the replacement may still have put the file in place
     CLOG::error("%s cannot write %s: %s", kWhere, path.c_str(), std::strerror(errno));
     return false;
   }
+  Advance();
   CLOG::med("%s wrote %zu records to %s", kWhere, count, path.c_str());
   return true;
 }
@@ -230,6 +245,7 @@ int HistoryStore::cleanupOldFiles(int64_t now, int64_t summary_seconds) const {
       CLOG::error("%s cannot remove %s: %s", kWhere, path.c_str(), std::strerror(errno));
       continue;
     }
+    Advance();
     CLOG::med("%s removed %s", kWhere, path.c_str());
     ++removed;
   }

@@ -12,10 +12,10 @@
 // Interval files are replaced through a temporary file and a rename, so a file under its final
 // name is always complete.
 //
-// Thread safety: the store holds no mutable state, so reads may run on any thread at any time
-// and see either the old or the new contents of a file being replaced. Two saves of the same
-// interval and stem must not overlap (they share a temporary name), nor a save with a cleanup
-// that could remove its temporary file; the analyzer's tree lock serialises all writers.
+// Thread safety: the store holds no mutable state but the generation, so reads may run on any
+// thread at any time and see either the old or the new contents of a file being replaced. Two saves
+// of the same interval and stem must not overlap (they share a temporary name), nor a save with a
+// cleanup that could remove its temporary file; the analyzer's tree lock serialises all writers.
 
 #include <cstddef>
 #include <cstdint>
@@ -75,6 +75,12 @@ class HistoryStore {
   // other file is touched (other names, other format versions, directories). Returns the number
   // of files removed; each removal is traced at detail level.
   int cleanupOldFiles(int64_t now, int64_t summary_seconds) const;
+
+  // A count of the changes every store of the process has made to its files (saves, removals),
+  // advanced once a change is in place: what was read after seeing one value reflects every
+  // change counted up to it, so a reader keeping what it derived from the files can tell when
+  // it may be stale.
+  static uint64_t generation();
 
  private:
   std::string directory_;  // history directory, without a trailing '/'

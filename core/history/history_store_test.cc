@@ -223,6 +223,30 @@ TEST_F(HistoryStoreTest, CleanupRemovesOnlyOldStoreFiles) {
   EXPECT_EQ(4, capture.count("removed "));
 }
 
+// Saves, removals and cleanups each move the generation on, so readers can tell their copies
+// stale; reading leaves it.
+TEST_F(HistoryStoreTest, ChangesAdvanceTheGeneration) {
+  uint64_t seen = HistoryStore::generation();
+  auto advanced = [&seen] {
+    const uint64_t now = HistoryStore::generation();
+    const bool moved = now > seen;
+    seen = now;
+    return moved;
+  };
+  save(kT, 1, 2);
+  EXPECT_TRUE(advanced());
+  EXPECT_EQ(2u, load(kT, 1, 10).size());
+  EXPECT_FALSE(advanced());
+  ASSERT_TRUE(store_.saveInterval(kT, "q7txot", nullptr, sizeof(Record), 0));
+  EXPECT_TRUE(advanced());
+  save(kT, 1, 2);
+  advanced();
+  EXPECT_EQ(0, store_.cleanupOldFiles(kT, 3600));
+  EXPECT_FALSE(advanced());
+  EXPECT_EQ(1, store_.cleanupOldFiles(kT + 7200, 3600));
+  EXPECT_TRUE(advanced());
+}
+
 // A history directory that was never written has nothing to clean.
 TEST_F(HistoryStoreTest, CleanupOfMissingDirectoryRemovesNothing) {
   EXPECT_EQ(0, store_.cleanupOldFiles(kT, 60));

@@ -22,6 +22,7 @@
 // keep it.
 
 #include <cstdint>
+#include <vector>
 
 #include "core/runtime/avl_node.h"
 #include "core/runtime/tree_node.h"
@@ -58,6 +59,9 @@ class AVLTree {
   // neighbour, so that callers can walk the structure from getRoot(). Null when absent.
   virtual TreeNode* getSmaller(TreeNode* key);
   virtual TreeNode* getLarger(TreeNode* key);
+  // Appends every stored object to nodes in order, left to right, straight down the structure:
+  // a walk through getSmaller/getLarger looks every entry up twice (and refreshes its recency).
+  void collectInOrder(std::vector<TreeNode*>& nodes) const;
   // No visible effect.
   virtual void dumpTree();
   virtual void dumpSortedTree();

@@ -108,6 +108,12 @@ void ExpectConsistent(AVLTree& tree, const std::multiset<int>& model,
   ASSERT_EQ(0, walk.unbalanced);
   ASSERT_TRUE(std::equal(walk.keys.begin(), walk.keys.end(), model.begin(), model.end()));
   ASSERT_EQ(static_cast<long>(model.size()), tree.getSize());
+  // collectInOrder walks the same structure; the recency checks below show it left no trace.
+  std::vector<TreeNode*> collected;
+  tree.collectInOrder(collected);
+  std::vector<int> collectedKeys;
+  std::transform(collected.begin(), collected.end(), std::back_inserter(collectedKeys), KeyOf);
+  ASSERT_EQ(walk.keys, collectedKeys);
 
   std::vector<int> forward;
   MTreeNode* last = nullptr;

@@ -4,9 +4,10 @@
 //
 // Locked for their whole run: addNode (with any trim it starts), removeNode (when lock is true),
 // findNode, getLarger, the dumps, markForDeletion, AddRef, Release and getRefCount.
-// Not locked: isTreeEmpty, getRoot, getSmaller, getSize, getMaxSize, getLRUNode, setMaxSize,
-// setRemoveCount, trimTreeByCount; callers that use these while other threads use the tree hold
-// their own lock around both. getSmaller stays unlocked while getLarger is locked, on purpose.
+// Not locked: isTreeEmpty, getRoot, getSmaller, collectInOrder, getSize, getMaxSize, getLRUNode,
+// setMaxSize, setRemoveCount, trimTreeByCount; callers that use these while other threads use the
+// tree hold their own lock around both. getSmaller stays unlocked while getLarger is locked, on
+// purpose.
 //
 // Object pointers returned are used after the lock is gone: a reader that keeps one pins it
 // with AddRef and lets go with Release. Ownership is as for AVLTree. The mutex is not recursive;

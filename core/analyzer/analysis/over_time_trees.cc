@@ -76,21 +76,12 @@ constexpr TableOps kTables[kOverTimeTables] = {
     Q7_ANALYZER_TABLES(Q7_TREE_OPS, Q7_NO_SUMMARY, Q7_NO_CURRENT, Q7_NO_INSTANCE)};
 #undef Q7_TREE_OPS
 
-void Collect(AVLTree& tree, TreeNode* node, std::vector<TreeNode*>& nodes) {
-  if (node == nullptr) {
-    return;
-  }
-  Collect(tree, tree.getSmaller(node), nodes);
-  nodes.push_back(node);
-  Collect(tree, tree.getLarger(node), nodes);
-}
-
 }  // namespace
 
 void getTreeNodes(AVLTree& tree, std::vector<TreeNode*>& nodes) {
   const size_t before = nodes.size();
   nodes.reserve(before + static_cast<size_t>(tree.getSize()));
-  Collect(tree, tree.getRoot(), nodes);
+  tree.collectInOrder(nodes);
   const size_t copied = nodes.size() - before;
   if (copied != static_cast<size_t>(tree.getSize())) {
     CLOG::min("ERROR: Copy'd %d nodes from tree of size[%d]", static_cast<int>(copied),

@@ -1,11 +1,13 @@
 // The analyzer's side of sampling: rows of the current interval's over-time trees plus the
-// summary period's history, summaries folded from them at query time, instance rows from the
-// instance files, and current-status rows.
+// summary period's history, summaries folded from them (the history's part kept between
+// queries, summary_fold.h), instance rows from the instance files, and current-status rows.
 
+#include <algorithm>
 #include <cstring>
 #include <memory>
 #include <vector>
 
+#include "core/analyzer/analysis/summary_fold.h"
 #include "core/analyzer/dpx_analyzer.h"
 #include "core/analyzer/rows/rows.h"
 #include "core/config/cconfig.h"
@@ -106,45 +108,91 @@ typename OverTimeRow::LayoutType* OverTimeRows(TSAVLTree& tree, const char* stem
   return rows.release();
 }
 
-// The second half of a summary query: the over-time rows (overTimeCount of them, the caller's
-// query) folded by the summary's key. The caller has traced the entry.
-template <class SummaryRow>
-typename SummaryRow::LayoutType* FoldSummary(
-    std::unique_ptr<typename SummaryRow::OverTimeLayoutType[]> overTime, int overTimeCount,
-    const char* where, int sampleType, int* count) {
-  using Layout = typename SummaryRow::LayoutType;
-  *count = 0;
-  TSAVLTree folded(0, false);
-  if (overTime && overTimeCount > 0) {
-    CLOG::max("%s, current data present.", where);
-    for (int i = 0; i < overTimeCount; ++i) {
-      SummaryRow key(overTime[i]);
-      key.setDeleteOnRemoval(false);  // a lookup key: the tree must not destroy it
-      if (auto* row = static_cast<SummaryRow*>(folded.findNode(&key))) {
-        row->Update(overTime[i]);
-        continue;
-      }
-      auto row = std::make_unique<SummaryRow>(overTime[i]);
-      if (folded.addNode(row.get())) {
-        row.release();  // the temporary tree owns it
-      }
-    }
-  } else {
-    CLOG::max("%s, no current data.", where);
-  }
-  overTime.reset();
-  Layout* rows = nullptr;
-  if (folded.getSize() >= 1) {
+// The row class and tree of each over-time layout.
+template <class Layout>
+struct OverTimeOf;
+#define Q7_OVER_TIME_OF(name, OverTimeRow, keys, Tree, EXPORT)  \
+  template <>                                                   \
+  struct OverTimeOf<kq7_q7##name##_data_t> {                    \
+    using Row = OverTimeRow;                                    \
+    static constexpr OverTimeTable kTree = OverTimeTable::Tree; \
+  };
+Q7_ANALYZER_TABLES(Q7_OVER_TIME_OF, Q7_NO_SUMMARY, Q7_NO_CURRENT, Q7_NO_INSTANCE)
+#undef Q7_OVER_TIME_OF
+
+// A summary query's share of the current interval: its over-time rows as layout rows with only
+// the columns a fold reads (getFoldColumns: the rest costs most of a layout row), their keys
+// and their order by key. With a limit, only the rows of the first limit keys are taken.
+template <class SummaryRow, class OverTimeRow>
+struct CurrentRows {
+  using Layout = typename SummaryRow::OverTimeLayoutType;
+
+  std::unique_ptr<Layout[]> rows;
+  size_t count = 0;
+  SummaryKeys<SummaryRow> keys;      // of rows; empty until ordered
+  std::vector<std::uint32_t> order;  // indexes of rows by key, once ordered
+  size_t treeRows = 0;               // rows in the tree
+
+  // Under the tree lock.
+  void take(TSAVLTree& tree, size_t limit) {
     std::vector<TreeNode*> nodes;
-    getTreeNodes(folded, nodes);
-    rows = new Layout[nodes.size()];
+    getTreeNodes(tree, nodes);
+    treeRows = nodes.size();
+    std::vector<const OverTimeRow*> taken(nodes.size());
     for (size_t i = 0; i < nodes.size(); ++i) {
-      static_cast<SummaryRow*>(nodes[i])->getQ7Struct(rows[i]);
+      taken[i] = static_cast<const OverTimeRow*>(nodes[i]);
     }
-    *count = static_cast<int>(nodes.size());
+    if (limit < taken.size()) {
+      const SummaryKeys<SummaryRow> allKeys(taken.data(), taken.size());
+      const std::vector<std::uint32_t> allOrder = allKeys.order();
+      std::vector<const OverTimeRow*> first;
+      size_t distinct = 0;
+      for (size_t i = 0; i < allOrder.size(); ++i) {
+        const std::string_view key = allKeys[allOrder[i]];
+        if (i == 0 || key != allKeys[allOrder[i - 1]]) {
+          if (distinct == limit) {
+            break;
+          }
+          ++distinct;
+        }
+        first.push_back(taken[allOrder[i]]);
+        keys.add(key);
+        order.push_back(static_cast<std::uint32_t>(order.size()));
+      }
+      taken = std::move(first);
+    }
+    count = taken.size();
+    rows.reset(new Layout[count]);
+    for (size_t i = 0; i < count; ++i) {
+      taken[i]->getFoldColumns(rows[i]);
+    }
   }
-  CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
-  return rows;
+
+  // Without the lock, after take.
+  void orderByKey() {
+    if (order.size() != count) {
+      keys = SummaryKeys<SummaryRow>(rows.get(), count);
+      order = keys.order();
+    }
+  }
+};
+
+// The history rows of stem in the window, as many as a query loads (MAX_ROWS at most).
+template <class Layout>
+std::unique_ptr<Layout[]> HistoryRows(const char* stem, const HistoryWindow& history,
+                                      size_t* count) {
+  const long from = history.interval - history.length;
+  const size_t rows = Capped(
+      history.store.countRows(stem, from, history.intervals, history.length, sizeof(Layout)));
+  *count = 0;
+  if (rows == 0) {
+    return nullptr;
+  }
+  // Not value-initialised: the load overwrites what it returns, and that is megabytes.
+  std::unique_ptr<Layout[]> out(new Layout[rows]);
+  *count = history.store.loadRows(stem, from, history.intervals, history.length, sizeof(Layout),
+                                  rows, out.get());
+  return out;
 }
 
 // A query of instance rows: the instance files (flushed first) of stem over the summary
@@ -190,6 +238,66 @@ Layout* CDPXAnalyzer::lockedQuery(Inner inner, int* count) {
   return rows;
 }
 
+template <class SummaryRow>
+typename SummaryRow::LayoutType* CDPXAnalyzer::summaryQuery(const char* stem,
+                                                            SummaryFoldCache<SummaryRow>& folds,
+                                                            const char* where, int sampleType,
+                                                            int* count, size_t limit) {
+  using Layout = typename SummaryRow::LayoutType;
+  using OverTimeLayout = typename SummaryRow::OverTimeLayoutType;
+  using OverTime = OverTimeOf<OverTimeLayout>;
+  const time_t now = fw::Now();
+  CLOG::enter(2, "%s(%d,--)", where, sampleType);
+  *count = 0;
+  if (sampleType != 3) {
+    CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
+    return nullptr;
+  }
+  CurrentRows<SummaryRow, typename OverTime::Row> current;
+  std::shared_ptr<const HistoryFold<SummaryRow>> folded;
+  std::unique_ptr<OverTimeLayout[]> historyRows;
+  size_t historyCount = 0;
+  typename SummaryFoldCache<SummaryRow>::Key key;
+  {
+    CvelMutexLock lock(treeMutex);
+    cache->flush();
+    current.take(cache->currentIntervalTrees().tree(OverTime::kTree), limit);
+    const HistoryWindow window{*history, getCurrentOverTimeInterval(), IntervalSeconds(),
+                               summaryIntervals()};
+    // The generation is read before the files: a change after it makes the next query refold.
+    key = {window.interval - window.length, window.length, window.intervals,
+           history::HistoryStore::generation()};
+    folded = folds.find(key);
+    if (folded == nullptr) {
+      historyRows = HistoryRows<OverTimeLayout>(stem, window, &historyCount);
+    }
+  }
+  // Ordering, folding and merging work on copies: processing need not wait for them.
+  if (folded == nullptr) {
+    folded = std::make_shared<const HistoryFold<SummaryRow>>(historyRows.get(), historyCount);
+    historyRows.reset();
+    folds.store(key, folded);
+  }
+  if (current.treeRows + folded->size() == 0) {
+    CLOG::max("%s, no current data.", where);
+    CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
+    return nullptr;
+  }
+  CLOG::max("%s, current data present.", where);
+  current.orderByKey();
+  Layout* rows = nullptr;
+  const size_t room = std::min(current.count + folded->size(), limit);
+  if (room > 0) {
+    std::unique_ptr<Layout[]> merged(new Layout[room]);
+    *count = static_cast<int>(
+        folded->merge(current.rows.get(), current.keys, current.order, limit, merged.get()));
+    StampSampleTime(merged.get(), *count, now);
+    rows = merged.release();
+  }
+  CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
+  return rows;
+}
+
 // ---- The named queries. ----
 
 // The public query over each inner one: the inner query under the tree lock, then the sample
@@ -203,15 +311,14 @@ Layout* CDPXAnalyzer::lockedQuery(Inner inner, int* count) {
         count);                                                                    \
   }
 
-// An over-time table: its tree and row class; and a summary: its row class, folded from the
-// over-time query of its over-time table.
 // The window of history the queries read.
 #define Q7_HISTORY_WINDOW                                                         \
   HistoryWindow {                                                                 \
     *history, getCurrentOverTimeInterval(), IntervalSeconds(), summaryIntervals() \
   }
 // An over-time table: its tree and row class; a summary: its row class, folded from the
-// over-time query of its over-time table; instance rows from the instance files.
+// current rows of its over-time table and that table's history; instance rows from the
+// instance files.
 #define Q7_OVER_TIME(ot, OverTimeRow, keys, Tree, EXPORT)                                          \
   kq7_q7##ot##_data_t* CDPXAnalyzer::i_get_tbl##ot(int sampleType, int* count, bool currentOnly) { \
     return OverTimeRows<OverTimeRow>(cache->currentIntervalTrees().tree(OverTimeTable::Tree),      \
@@ -219,16 +326,11 @@ Layout* CDPXAnalyzer::lockedQuery(Inner inner, int* count) {
                                      count, currentOnly);                                          \
   }                                                                                                \
   Q7_LOCKED_QUERY(ot, false)
-#define Q7_SUMMARY(sm, SummaryRow, keys, ot)                                            \
-  kq7_q7##sm##_data_t* CDPXAnalyzer::i_get_tbl##sm(int sampleType, int* count) {        \
-    CLOG::enter(2, "%s(%d,--)", "i_get_tbl" #sm, sampleType);                           \
-    int overTimeCount = 0;                                                              \
-    std::unique_ptr<kq7_q7##ot##_data_t[]> overTime(                                    \
-        i_get_tbl##ot(sampleType, &overTimeCount, false));                              \
-    return FoldSummary<SummaryRow>(std::move(overTime), overTimeCount, "i_get_tbl" #sm, \
-                                   sampleType, count);                                  \
-  }                                                                                     \
-  Q7_LOCKED_QUERY(sm)
+#define Q7_SUMMARY(sm, SummaryRow, keys, ot)                                                 \
+  kq7_q7##sm##_data_t* CDPXAnalyzer::get_tbl##sm(int sampleType, int* count, size_t limit) { \
+    return summaryQuery<SummaryRow>("q7" #ot, summaryFolds->sm, "i_get_tbl" #sm, sampleType, \
+                                    count, limit);                                           \
+  }
 #define Q7_INSTANCE(name)                                                                        \
   kq7_q7##name##_data_t* CDPXAnalyzer::i_get_tbl##name(int sampleType, int* count) {             \
     return InstanceRows<kq7_q7##name##_data_t>("q7" #name, *instanceFile, *subInstanceFile,      \

@@ -141,7 +141,12 @@ void CBaseTable::reset(long now) {
 }
 
 CommonColumns CBaseTable::getCommonData() const {
-  static const char* const kWhere = "CBaseTable::getCommonData";
+  CommonColumns out = getCommonCounts();
+  addCommonPercentages(&out);
+  return out;
+}
+
+CommonColumns CBaseTable::getCommonCounts() const {
   CommonColumns out{};
   out.dintval = commonData.dintval;
   const int32_t n = commonData.totreq;
@@ -158,7 +163,16 @@ CommonColumns CBaseTable::getCommonData() const {
   out.clienttime = perRequest(commonData.clienttime, n);
   out.netwtime = perRequest(commonData.netwtime, n);
   out.servtime = perRequest(commonData.servtime, n);
+  return out;
+}
 
+void CBaseTable::addCommonPercentages(CommonColumns* counts) const {
+  static const char* const kWhere = "CBaseTable::getCommonData";
+  CommonColumns& out = *counts;
+  const int32_t n = commonData.totreq;
+  if (n == 0) {
+    return;
+  }
   int32_t slow = percentOfRequests(commonData.slowreq, n);
   int32_t fail = percentOfRequests(commonData.failreq, n);
   int32_t good = static_cast<int32_t>(
@@ -180,7 +194,6 @@ CommonColumns CBaseTable::getCommonData() const {
   out.pcfail = fail;
   out.pcgood = good;
   out.pcavail = 100000 - fail;
-  return out;
 }
 
 void updateDPXData(CDPXTransaction& t, dpx_data_t& data, int /*totreq*/) {
@@ -337,10 +350,6 @@ int32_t percentOfRequests(int32_t count, int32_t n) {
     return 0;
   }
   return static_cast<int32_t>(static_cast<long double>(count) / n * 100000.0L);
-}
-
-int32_t perRequest(int64_t sum, int32_t n) {
-  return n == 0 ? 0 : static_cast<int32_t>(sum / n);
 }
 
 long calculateRank(long a, long b, short c) {

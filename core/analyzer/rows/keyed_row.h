@@ -16,6 +16,7 @@
 #include <functional>
 #include <string>
 #include <string_view>
+#include <type_traits>
 
 #include "core/analyzer/intake/dpx_transaction.h"
 #include "core/analyzer/rows/base_table.h"
@@ -204,6 +205,35 @@ class TKeyedRow : public CBaseTable {
     return 0;
   }
 
+  // The key of a layout row, or of a keyed row with the same fields, as one byte string that
+  // orders as rows made from it compare: each field in comparison order, up to its first NUL,
+  // and a NUL after it. Comparing two such strings bytewise compares field by field as strncmp
+  // does (a field that ends first is the lesser), and equal strings are equal keys. Lets a fold
+  // sort rows without building them.
+  template <class Source>
+  static void appendSortKey(const Source& source, std::string* out) {
+    for (int i : kSpec.order) {
+      const Key field = kSpec.fields[i];
+      const char* text;
+      if constexpr (std::is_base_of_v<CBaseTable, Source>) {
+        text = source.keyField(field);
+      } else {
+        text = ColumnOf(const_cast<Source&>(source), field);
+      }
+      out->append(text, strnlen(text, KeyWidth(field)));
+      out->push_back('\0');
+    }
+  }
+
+  // The key field for key, KeyWidth bytes; the row must have that field.
+  const char* keyField(Key field) const {
+    std::size_t i = 0;
+    while (i + 1 < kKeys && kSpec.fields[i] != field) {
+      ++i;
+    }
+    return key(i);
+  }
+
   const char* toString(int) override {
     static char buffer[1024];
     buffer[0] = '\0';
@@ -299,6 +329,32 @@ class TKeyedRow : public CBaseTable {
   template <class Layout>
   void fillLayout(Layout& row) const {
     memset(&row, 0, sizeof(row));
+    CommonColumns c = getCommonCounts();
+    fillFoldColumns(row, c);
+    CopyField(row.originnode, OriginNode(), sizeof(row.originnode));
+    CopyField(row.datcoltype, "DPX", sizeof(row.datcoltype));
+    addCommonPercentages(&c);
+    row.pcfail = c.pcfail;
+    row.pcslow = c.pcslow;
+    row.pcgood = c.pcgood;
+    row.pcavail = c.pcavail;
+    row.rank =
+        static_cast<int32_t>(calculateRank(c.pcfail / 1000, c.pcslow / 1000, carried_.importance));
+#define Q7_PERCENT(code) \
+  row.pct##code = percentOfRequests(kindData.dpx.num##code, commonData.totreq);
+    Q7_DPX_STATUS_CODES(Q7_PERCENT)
+#undef Q7_PERCENT
+  }
+
+  // Only the columns of the layout that a summary fold reads (TSummaryRow's constructor and
+  // Update): keys, carried columns, aggby, threshold, timestamp, counts, averages and status
+  // counts, as fillLayout writes them. The other columns are left as they were.
+  template <class Layout>
+  void fillFoldColumns(Layout& row) const {
+    fillFoldColumns(row, getCommonCounts());
+  }
+  template <class Layout>
+  void fillFoldColumns(Layout& row, const CommonColumns& c) const {
     for (std::size_t i = 0; i < kKeys; ++i) {
       memcpy(ColumnOf(row, kSpec.fields[i]), key(i), KeyWidth(kSpec.fields[i]));
     }
@@ -313,27 +369,18 @@ class TKeyedRow : public CBaseTable {
       row.aggby = aggBy;
     if constexpr (requires { row.mrtthres; })
       row.mrtthres = commonData.mtrthres;
-    CopyField(row.originnode, OriginNode(), sizeof(row.originnode));
     memcpy(row.timestamp, timestamp, sizeof(row.timestamp));
-    CopyField(row.datcoltype, "DPX", sizeof(row.datcoltype));
-
-    const CommonColumns c = getCommonData();
 #define Q7_COPY_COMMON(column) row.column = c.column;
     Q7_COMMON_COLUMNS(Q7_COPY_COMMON)
 #undef Q7_COPY_COMMON
-    row.rank =
-        static_cast<int32_t>(calculateRank(c.pcfail / 1000, c.pcslow / 1000, carried_.importance));
-
     const int32_t n = commonData.totreq;
     const dpx_data_t& d = kindData.dpx;
 #define Q7_AVERAGE(sum) row.sum = perRequest(d.sum, n);
     Q7_DPX_SUMS(Q7_AVERAGE)
 #undef Q7_AVERAGE
-#define Q7_COUNT_AND_PERCENT(code) \
-  row.num##code = d.num##code;     \
-  row.pct##code = percentOfRequests(d.num##code, n);
-    Q7_DPX_STATUS_CODES(Q7_COUNT_AND_PERCENT)
-#undef Q7_COUNT_AND_PERCENT
+#define Q7_COUNT(code) row.num##code = d.num##code;
+    Q7_DPX_STATUS_CODES(Q7_COUNT)
+#undef Q7_COUNT
   }
 
  private:
@@ -409,6 +456,8 @@ class TOverTimeRow : public TKeyedRow<kSpec> {
   }
 
   void getQ7Struct(Layout& row) const { this->fillLayout(row); }
+  // Only the columns a summary fold reads, at a fraction of getQ7Struct's cost.
+  void getFoldColumns(Layout& row) const { this->fillFoldColumns(row); }
 };
 
 // A summary row: one key over the summary period, built by folding exported over-time rows of

@@ -5,8 +5,11 @@
 #include <time.h>
 
 #include <array>
+#include <climits>
 #include <memory>
+#include <random>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "core/analyzer/intake/other_transactions.h"
@@ -142,6 +145,38 @@ TEST(RowArithmeticTest, MinimumCombinesWithZero) {
   EXPECT_EQ(80, row.minrtt);
   EXPECT_EQ(80, row.mmaxrtt);
   EXPECT_EQ(3, row.totreq);
+}
+
+// perRequest divides mostly in double; it must truncate as the integer division does, near
+// whole quotients, for negative sums and beyond double's exact range too.
+TEST(RowArithmeticTest, PerRequestIsTheIntegerQuotient) {
+  std::mt19937_64 rng(9);
+  std::vector<std::pair<int64_t, int32_t>> cases = {{0, 0},
+                                                    {5, 0},
+                                                    {7, 2},
+                                                    {-7, 2},
+                                                    {6, 3},
+                                                    {-6, 3},
+                                                    {1, 1},
+                                                    {-1, 7},
+                                                    {(int64_t{1} << 52) - 1, 3},
+                                                    {-(int64_t{1} << 52) + 1, 3},
+                                                    {int64_t{1} << 53, 7},
+                                                    {INT64_MIN, 3},
+                                                    {INT64_MAX, 2147483647},
+                                                    {-9, -2},
+                                                    {9, -2}};
+  for (int i = 0; i < 200000; ++i) {
+    const int32_t n = static_cast<int32_t>(1 + rng() % (i % 2 == 0 ? 1000 : 2147483647u));
+    // Quotients at and next to whole numbers, where a rounded double quotient goes wrong.
+    const int64_t q = static_cast<int64_t>(rng() % (int64_t{1} << (rng() % 40)));
+    const int64_t sum = (i % 3 == 0 ? -1 : 1) * (q * n + static_cast<int64_t>(rng() % 3) - 1);
+    cases.emplace_back(sum, n);
+  }
+  for (const auto& [sum, n] : cases) {
+    const int32_t want = n == 0 ? 0 : static_cast<int32_t>(sum / n);
+    ASSERT_EQ(want, perRequest(sum, n)) << sum << " / " << n;
+  }
 }
 
 TEST(RowArithmeticTest, RankWrapsIn32Bits) {
