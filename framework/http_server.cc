@@ -31,6 +31,8 @@ namespace {
 constexpr char kUnit[] = "http";
 constexpr std::size_t kMaxBodyBytes = 64 * 1024;
 constexpr std::size_t kWorkerThreads = 16;
+// Samples of more rows are sent in chunks of this many rows, each written as the last is sent.
+constexpr int kStreamedRows = 512;
 
 const auto kProcessStart = std::chrono::steady_clock::now();
 
@@ -135,8 +137,27 @@ void ServeSample(const httplib::Request& req, httplib::Response& res) {
   if (format == SampleFormat::kCsv) {
     res.status = 200;
     res.set_content(SampleToCsv(sample), "text/csv");
-  } else {
+  } else if (sample.row_count() <= kStreamedRows) {
     ReplyJsonText(res, 200, SampleToJsonText(sample));
+  } else {
+    // Written while it is sent: the client reads the first rows while the rest are written.
+    struct Streamed {
+      explicit Streamed(Sample s) : sample(std::move(s)), writer(sample) {}
+      const Sample sample;
+      SampleJsonWriter writer;
+      std::string piece;
+    };
+    auto streamed = std::make_shared<Streamed>(std::move(sample));
+    res.status = 200;
+    res.set_chunked_content_provider(
+        "application/json", [streamed](std::size_t, httplib::DataSink& sink) {
+          streamed->piece.clear();
+          if (!streamed->writer.Next(&streamed->piece, kStreamedRows)) {
+            sink.done();
+            return true;
+          }
+          return sink.write(streamed->piece.data(), streamed->piece.size());
+        });
   }
 }
 

@@ -6,6 +6,7 @@
 #include <charconv>
 #include <cstdint>
 #include <cstring>
+#include <limits>
 #include <utility>
 #include <vector>
 
@@ -13,6 +14,25 @@
 #include "framework/status.h"
 
 namespace fw {
+
+// Room a row's writing may overrun by: short pieces are copied in whole blocks of this size.
+constexpr std::size_t kBlock = 32;
+
+// How one member of a row object is written: the text before its value, and where the value is.
+struct MemberPlan {
+  // A piece of at most kBlock bytes kept in a block of its own, so that copying it is two moves
+  // rather than a call (the writer leaves kBlock bytes of room past what it writes).
+  struct ShortText {
+    char bytes[kBlock] = {};
+    std::size_t size = 0;
+  };
+
+  std::string prefix;      // ",\n" or "\n" (the first), indent, quoted name, ": "
+  ShortText short_prefix;  // the same when it fits a block
+  const ColumnInfo* column;
+  bool text;
+};
+
 namespace {
 
 // The same rule the row filter applies: optional blanks around a decimal that fits 64 bits.
@@ -91,28 +111,11 @@ char* Put(char* at, std::string_view text) {
   return at + text.size();
 }
 
-// Room a row's writing may overrun by: short pieces are copied in whole blocks of this size.
-constexpr std::size_t kBlock = 32;
 
-// A piece of at most kBlock bytes kept in a block of its own, so that copying it is two moves
-// rather than a call (the writer leaves kBlock bytes of room past what it writes).
-struct ShortText {
-  char bytes[kBlock] = {};
-  std::size_t size = 0;
-};
-
-char* Put(char* at, const ShortText& text) {
+char* Put(char* at, const MemberPlan::ShortText& text) {
   std::memcpy(at, text.bytes, kBlock);
   return at + text.size;
 }
-
-// How one member of a row object is written: the text before its value, and where the value is.
-struct MemberPlan {
-  std::string prefix;      // ",\n" or "\n" (the first), indent, quoted name, ": "
-  ShortText short_prefix;  // the same when it fits a block
-  const ColumnInfo* column;
-  bool text;
-};
 
 char* PutPrefix(char* at, const MemberPlan& member) {
   return member.short_prefix.size != 0 ? Put(at, member.short_prefix) : Put(at, member.prefix);
@@ -194,50 +197,62 @@ nlohmann::ordered_json SampleToJson(const Sample& sample) {
   return body;
 }
 
-std::string SampleToJsonText(const Sample& sample) {
+SampleJsonWriter::SampleJsonWriter(const Sample& sample) : sample_(sample) {
   // One member per distinct column name, placed where the name first appears and holding the
   // last such column's value: what assigning every column into an ordered object leaves.
-  std::vector<MemberPlan> members;
   for (const ColumnInfo& column : sample.table->columns) {
     const std::string_view name = column.name;
-    auto same = std::find_if(members.begin(), members.end(),
+    auto same = std::find_if(members_.begin(), members_.end(),
                              [&](const MemberPlan& m) { return m.column->name == name; });
-    if (same != members.end()) {
+    if (same != members_.end()) {
       same->column = &column;
       same->text = IsTextColumn(column);
     } else {
-      members.push_back({"      " + DumpedString(name) + ": ", {}, &column, IsTextColumn(column)});
+      members_.push_back({"      " + DumpedString(name) + ": ", {}, &column, IsTextColumn(column)});
     }
   }
   // A row's text when every value takes the plain path, and the overrun room; anything longer
   // reserves again.
-  std::size_t row_bound = 16 + kBlock;
-  for (std::size_t m = 0; m < members.size(); ++m) {
-    MemberPlan& member = members[m];
+  row_bound_ = 16 + kBlock;
+  for (std::size_t m = 0; m < members_.size(); ++m) {
+    MemberPlan& member = members_[m];
     member.prefix.insert(0, m == 0 ? "\n" : ",\n");
     if (member.prefix.size() <= kBlock) {
       std::memcpy(member.short_prefix.bytes, member.prefix.data(), member.prefix.size());
       member.short_prefix.size = member.prefix.size();
     }
-    row_bound += member.prefix.size() +
-                 (member.text ? static_cast<std::size_t>(member.column->width) + 2 : 11);
+    row_bound_ += member.prefix.size() +
+                  (member.text ? static_cast<std::size_t>(member.column->width) + 2 : 11);
   }
+}
 
-  std::string out = "{\n  \"table\": " + DumpedString(sample.table->name) + ",\n  \"rows\": ";
-  const int count = sample.row_count();
-  if (count == 0) {
-    return out + "[]\n}\n";
+SampleJsonWriter::~SampleJsonWriter() = default;
+
+bool SampleJsonWriter::Next(std::string* out, int max_rows) {
+  const int count = sample_.row_count();
+  if (next_row_ < 0) {
+    *out += "{\n  \"table\": " + DumpedString(sample_.table->name) + ",\n  \"rows\": ";
+    next_row_ = 0;
+    if (count == 0) {
+      *out += "[]\n}\n";
+      next_row_ = count + 1;
+      return true;
+    }
+    *out += "[\n";
   }
-  out += "[\n";
+  if (next_row_ > count) {
+    return false;
+  }
   TextBuffer row_text;
-  for (int i = 0; i < count; ++i) {
-    const char* row = static_cast<const char*>(sample.row(i));
-    char* at = row_text.Reserve(row_bound);
+  const int last = std::min(count, next_row_ + std::max(max_rows, 1));
+  for (int i = next_row_; i < last; ++i) {
+    const char* row = static_cast<const char*>(sample_.row(i));
+    char* at = row_text.Reserve(row_bound_);
     at = Put(at, i == 0 ? std::string_view("    {") : std::string_view(",\n    {"));
-    if (members.empty()) {
+    if (members_.empty()) {
       at = Put(at, "}");
     }
-    for (const MemberPlan& member : members) {
+    for (const MemberPlan& member : members_) {
       at = PutPrefix(at, member);
       const ColumnInfo& column = *member.column;
       if (!member.text) {
@@ -253,21 +268,33 @@ std::string SampleToJsonText(const Sample& sample) {
       }
       const std::string dumped = DumpedString(text);
       row_text.Commit(at);
-      at = Put(row_text.Reserve(dumped.size() + row_bound), dumped);
+      at = Put(row_text.Reserve(dumped.size() + row_bound_), dumped);
     }
-    if (!members.empty()) {
+    if (!members_.empty()) {
       at = Put(at, "\n    }");
     }
     row_text.Commit(at);
-    if (i == 0) {
+    if (i == next_row_) {
       // Rows are alike in size: the first tells how much the rest will take.
-      out.reserve(out.size() + row_text.text().size() * static_cast<std::size_t>(count) * 9 / 8 +
-                  16);
+      out->reserve(out->size() + row_text.text().size() * static_cast<std::size_t>(last - i) * 9 / 8 +
+                   16);
     }
-    out += row_text.text();
+    *out += row_text.text();
     row_text.Clear();
   }
-  out += "\n  ]\n}\n";
+  next_row_ = last;
+  if (next_row_ == count) {
+    *out += "\n  ]\n}\n";
+    next_row_ = count + 1;
+  }
+  return true;
+}
+
+std::string SampleToJsonText(const Sample& sample) {
+  SampleJsonWriter writer(sample);
+  std::string out;
+  while (writer.Next(&out, std::numeric_limits<int>::max())) {
+  }
   return out;
 }
 

@@ -15,6 +15,7 @@
 #include <span>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "framework/request.h"
 #include "framework/table_sample.h"
@@ -46,6 +47,29 @@ nlohmann::ordered_json SampleToJson(const Sample& sample);
 // replacing error handler, then "\n". Written straight from the rows, without the document
 // tree, which costs far more than the text for samples of thousands of rows.
 std::string SampleToJsonText(const Sample& sample);
+
+struct MemberPlan;
+
+// Writes SampleToJsonText(sample) in pieces, so that a large reply can go out while the rest of
+// it is written. The sample must outlive the writer. Not thread-safe; one reply's thread uses it.
+class SampleJsonWriter {
+ public:
+  explicit SampleJsonWriter(const Sample& sample);
+  ~SampleJsonWriter();
+  SampleJsonWriter(const SampleJsonWriter&) = delete;
+  SampleJsonWriter& operator=(const SampleJsonWriter&) = delete;
+
+  // Appends the next piece to *out: the opening with up to max_rows rows (at least one), then
+  // up to max_rows more at a time, the closing with the last. False, appending nothing, once
+  // everything is written.
+  bool Next(std::string* out, int max_rows);
+
+ private:
+  const Sample& sample_;
+  std::vector<MemberPlan> members_;
+  std::size_t row_bound_ = 0;
+  int next_row_ = -1;  // -1 before the opening; row_count() + 1 after the closing
+};
 
 // A header line of attribute names, then one line per row, each ended by '\n'. Fields holding a
 // comma, a quote or a line end are quoted, with quotes doubled.

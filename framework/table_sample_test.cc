@@ -230,7 +230,7 @@ TEST(SampleJsonTextTest, IsTheDocumentDumped) {
   for (int round = 0; round < 500; ++round) {
     Sample sample;
     sample.table = table;
-    for (int r = static_cast<int>(rng() % 4); r > 0; --r) {
+    for (int r = static_cast<int>(rng() % 6); r > 0; --r) {
       Wide row;
       std::memset(&row, 0, sizeof(row));
       fill(row.name, sizeof(row.name));
@@ -246,6 +246,15 @@ TEST(SampleJsonTextTest, IsTheDocumentDumped) {
         SampleToJson(sample).dump(2, ' ', false, nlohmann::ordered_json::error_handler_t::replace) +
         "\n";
     ASSERT_EQ(want, SampleToJsonText(sample)) << "round " << round;
+    // Written in pieces of any size, as a streamed reply is, the text is the same.
+    SampleJsonWriter writer(sample);
+    std::string pieces;
+    const int rows = static_cast<int>(rng() % 3);
+    while (writer.Next(&pieces, rows)) {
+    }
+    ASSERT_EQ(want, pieces) << "round " << round << ", " << rows << " rows a piece";
+    EXPECT_FALSE(writer.Next(&pieces, rows));
+    EXPECT_EQ(want, pieces);
   }
 }
 
@@ -350,6 +359,24 @@ TEST_F(SampleEndpointTest, AnswersFilteredLimitedSamples) {
       Get("/api/v1/tables/FAKE?format=csv&where=delta%20GT%200&where=count%20LT%2050");
   EXPECT_EQ(200, status);
   EXPECT_EQ("name,delta,note,count\nBank,5,\"say \"\"hi\"\"\",12\nShop,100,,-1\n", body);
+}
+
+// A sample too large for one piece is sent in chunks as it is written, and arrives whole.
+TEST_F(SampleEndpointTest, LargeSamplesArriveWhole) {
+  fake.rows.clear();
+  for (int i = 0; i < 1500; ++i) {
+    const std::string name = "row" + std::to_string(i);
+    fake.rows.push_back(Row(name.c_str(), static_cast<std::int16_t>(i % 100),
+                            i % 7 == 0 ? "q\"uote" : "", i));
+  }
+  Sample sample;
+  std::string error;
+  ASSERT_EQ(kOk, SampleTable("FAKE", {}, &sample, &error)) << error;
+  auto res = client_->Get("/api/v1/tables/FAKE");
+  ASSERT_TRUE(res);
+  ASSERT_EQ(200, res->status);
+  EXPECT_EQ(SampleToJsonText(sample), res->body);
+  EXPECT_EQ("application/json", res->get_header_value("Content-Type"));
 }
 
 // Rows need not be valid UTF-8; the answer still goes out.
