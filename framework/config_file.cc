@@ -17,6 +17,8 @@ namespace {
 constexpr char kUnit[] = "framework";
 // inih keeps section names in a 50-byte buffer and cuts longer ones silently.
 constexpr std::size_t kMaxSectionName = 49;
+// inih keeps the last entry's name in a 50-byte buffer for continuation lines, cut the same way.
+constexpr std::size_t kMaxContinuedName = 49;
 
 class FileDescriptor {
  public:
@@ -83,8 +85,9 @@ struct ConfigFileBuilder {
   std::string_view text;
   std::size_t pos = 0;
   int line_number = 0;
-  bool after_entry = false;  // inih treats an indented line after an entry as a continuation
-  int error_line = 0;        // first line this builder rejected itself
+  bool after_entry = false;         // inih treats an indented line after an entry as a continuation
+  std::size_t entry_name_size = 0;  // of the last entry, which a continuation line continues
+  int error_line = 0;               // first line this builder rejected itself
   std::string error_reason;
   ConfigFile result;
 
@@ -171,7 +174,22 @@ struct ConfigFileBuilder {
     std::memcpy(str, line.data(), line.size());
     str[line.size()] = '\0';
     self->NoteHeader(line);
+    if (self->IsContinuation(line) && self->entry_name_size > kMaxContinuedName) {
+      self->Reject("continuation line of a name longer than 49 characters");
+    }
     return str;
+  }
+
+  // As inih tells one: after an entry, indented, neither blank nor a comment.
+  bool IsContinuation(std::string_view line) const {
+    if (!after_entry || line.empty() || !IsSpace(line[0])) {
+      return false;
+    }
+    std::size_t start = 0;
+    while (start < line.size() && IsSpace(line[start])) {
+      ++start;
+    }
+    return start < line.size() && line[start] != ';' && line[start] != '#';
   }
 
   static int Handle(void* user, const char* section, const char* name, const char* value) {
@@ -179,6 +197,7 @@ struct ConfigFileBuilder {
     // inih passes a null value only when built to allow names without one.
     self->Section(section)->entries.push_back({name, value != nullptr ? value : ""});
     self->after_entry = name[0] != '\0';
+    self->entry_name_size = std::strlen(name);
     return 1;
   }
 };

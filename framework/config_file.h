@@ -8,9 +8,9 @@
 //
 // Instances, sections and entries keep their file order. An instance exists once a header or
 // an entry names it; a header repeated later reopens its section, whose new entries follow the
-// earlier ones. A line of 200 characters or more, a NUL byte and a section name longer than 49
-// characters are parse failures naming the line (inih would otherwise split, stop or cut
-// silently).
+// earlier ones. A line of 200 characters or more, a NUL byte, a section name longer than 49
+// characters and a continuation line under an entry name longer than 49 characters are parse
+// failures naming the line (inih would otherwise split, stop or cut silently).
 //
 // Thread safety: a ConfigFile is a plain value; parse on one thread, read from any.
 

@@ -106,6 +106,10 @@ TEST(ConfigFileTest, SyntaxErrorsNameTheirLine) {
   EXPECT_NE(std::string::npos, ParseFails("[S]\na=1\nno equals here\n").find("line 3"));
   EXPECT_NE(std::string::npos, ParseFails("a=1\n[unclosed\nb=2\n").find("line 2"));
   EXPECT_NE(std::string::npos, ParseFails("[" + std::string(50, 's') + "]\n").find("line 1"));
+  // A long name is whole on its own line, but inih would cut it for a continuation line.
+  const std::string name50(50, 'n');
+  EXPECT_EQ("|S|" + name50 + "=1\n", ParseOk("[S]\n" + name50 + "=1\n"));
+  EXPECT_NE(std::string::npos, ParseFails("[S]\n" + name50 + "=1\n  2\n").find("line 3"));
 }
 
 // NUL bytes and random binary junk are parse failures or odd entries, never a crash.

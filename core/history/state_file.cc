@@ -48,7 +48,9 @@ bool StateFile::load() {
     const size_t end = rest.find('\n');
     std::string_view line = rest.substr(0, end);
     rest.remove_prefix(end == std::string_view::npos ? rest.size() : end + 1);
-    if (line.ends_with('\r')) {
+    // Every trailing CR: a line kept with one would be written back as a line that reads
+    // without it.
+    while (line.ends_with('\r')) {
       line.remove_suffix(1);
     }
     if (line.empty()) {

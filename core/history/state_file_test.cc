@@ -41,7 +41,7 @@ TEST_F(StateFileTest, RoundTrip) {
 // Lines of other keys survive a save; unreadable times are skipped and reported.
 TEST_F(StateFileTest, KeepsOtherLinesAndSkipsBadTimes) {
   dir_.write("q7state.properties",
-             "# written by hand\r\nOther.key=1\nLastHistoricalQueryTime.q7txot=12x\n"
+             "# written by hand\r\r\nOther.key=1\nLastHistoricalQueryTime.q7txot=12x\n"
              "LastHistoricalQueryTime.q7clntot=7\r\n\nLastHistoricalQueryTime.=3\n");
   fw::TraceCapture capture;
   StateFile state(path_);
