@@ -8,8 +8,11 @@
 #   make asan / make tsan   sanitizer builds with their unit tests (asan: clang, with the
 #                           thread-safety analysis)
 #   make test-tsan          the concurrency tests (runtime, situations, analyzer) under TSan
-#   make fuzz     clang libFuzzer builds of the record parser, the HTTP parser and the capture
-#                 pipeline, each run for FUZZ_SECONDS (default 60)
+#   make fuzz     clang libFuzzer builds of the record parser, the HTTP parser, the capture
+#                 pipeline, the configuration, properties and history files and the HTTP API's
+#                 inputs, each run for FUZZ_SECONDS (default 60)
+#   make fuzz-smoke         the same targets for FUZZ_SMOKE_SECONDS (default 20) each, from their
+#                           seeds only; fails on any finding
 
 SHELL := /bin/bash
 BUILD_TYPE ?= RelWithDebInfo
@@ -26,7 +29,8 @@ DEPS := cmake ninja-build g++ make pkg-config git curl \
 
 SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
 
-.PHONY: all deps build test test-tsan demo bench install asan tsan fuzz clean format
+.PHONY: all deps build test test-tsan demo bench install asan tsan fuzz fuzz-build fuzz-smoke \
+        clean format
 
 all: build
 
@@ -91,20 +95,46 @@ bench: deps
 	bench/q7bench_series.sh build-release/bin/bench_q7bench 5
 
 FUZZ_SECONDS ?= 60
-FUZZ_TARGETS := sm3_fuzz http_parser_fuzz capture_fuzz
-fuzz: deps
+FUZZ_SMOKE_SECONDS ?= 20
+FUZZ_TARGETS := sm3_fuzz http_parser_fuzz capture_fuzz config_fuzz properties_fuzz api_fuzz \
+                history_fuzz
+# Each target's corpus (under build-fuzz/), seeds (under tests/fuzz/) and options; by default
+# corpus_<target> and seeds_<target>.
+FUZZ_CORPUS_sm3_fuzz := corpus
+FUZZ_SEEDS_sm3_fuzz := seeds
+FUZZ_OPTS_sm3_fuzz := -max_len=40000 -dict=$(CURDIR)/tests/fuzz/sm3.dict
+FUZZ_OPTS_http_parser_fuzz := -max_len=8192 -dict=$(CURDIR)/tests/fuzz/http.dict
+FUZZ_OPTS_capture_fuzz := -max_len=16384 -dict=$(CURDIR)/tests/fuzz/http.dict
+FUZZ_OPTS_config_fuzz := -max_len=4096 -dict=$(CURDIR)/tests/fuzz/config.dict
+FUZZ_OPTS_properties_fuzz := -max_len=8192 -dict=$(CURDIR)/tests/fuzz/properties.dict
+FUZZ_OPTS_api_fuzz := -max_len=2048 -dict=$(CURDIR)/tests/fuzz/api.dict
+FUZZ_OPTS_history_fuzz := -max_len=16384
+fuzz_corpus = build-fuzz/$(or $(FUZZ_CORPUS_$(1)),corpus_$(1))
+fuzz_seeds = $(CURDIR)/tests/fuzz/$(or $(FUZZ_SEEDS_$(1)),seeds_$(1))
+# UBSan reports stop the run, so that they count as findings.
+FUZZ_ENV := UBSAN_OPTIONS=halt_on_error=1:print_stacktrace=1
+define newline
+
+
+endef
+
+fuzz-build: deps
 	cmake -S . -B build-fuzz $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=RelWithDebInfo \
 	  -DCMAKE_C_COMPILER=clang -DCMAKE_CXX_COMPILER=clang++ -DQ7_FUZZ=ON -DQ7_BUILD_TESTS=OFF
 	cmake --build build-fuzz -j $(JOBS) --target $(FUZZ_TARGETS)
-	mkdir -p build-fuzz/corpus build-fuzz/corpus_http_parser_fuzz build-fuzz/corpus_capture_fuzz
-	cd build-fuzz && bin/sm3_fuzz -max_total_time=$(FUZZ_SECONDS) -max_len=40000 \
-	  -print_final_stats=1 -dict=$(CURDIR)/tests/fuzz/sm3.dict corpus $(CURDIR)/tests/fuzz/seeds
-	cd build-fuzz && bin/http_parser_fuzz -max_total_time=$(FUZZ_SECONDS) -max_len=8192 \
-	  -print_final_stats=1 -dict=$(CURDIR)/tests/fuzz/http.dict corpus_http_parser_fuzz \
-	  $(CURDIR)/tests/fuzz/seeds_http_parser_fuzz
-	cd build-fuzz && bin/capture_fuzz -max_total_time=$(FUZZ_SECONDS) -max_len=16384 \
-	  -print_final_stats=1 -dict=$(CURDIR)/tests/fuzz/http.dict corpus_capture_fuzz \
-	  $(CURDIR)/tests/fuzz/seeds_capture_fuzz
+
+# Each target on its corpus, which keeps what it finds, and its seeds.
+fuzz: fuzz-build
+	$(foreach t,$(FUZZ_TARGETS),mkdir -p $(call fuzz_corpus,$(t))$(newline)\
+	cd build-fuzz && $(FUZZ_ENV) bin/$(t) -max_total_time=$(FUZZ_SECONDS) -print_final_stats=1 \
+	  $(FUZZ_OPTS_$(t)) $(CURDIR)/$(call fuzz_corpus,$(t)) $(call fuzz_seeds,$(t))$(newline))
+
+# Each target briefly from its seeds alone (new inputs go to a scratch corpus); any crash, leak,
+# hang or UBSan report fails.
+fuzz-smoke: fuzz-build
+	$(foreach t,$(FUZZ_TARGETS),rm -rf build-fuzz/smoke_$(t) && mkdir -p build-fuzz/smoke_$(t)$(newline)\
+	cd build-fuzz && $(FUZZ_ENV) bin/$(t) -max_total_time=$(FUZZ_SMOKE_SECONDS) -timeout=20 \
+	  -print_final_stats=1 $(FUZZ_OPTS_$(t)) smoke_$(t) $(call fuzz_seeds,$(t))$(newline))
 
 install: build
 	cmake --install build --prefix "$(PREFIX)"
