@@ -1,7 +1,8 @@
 # q7agent: developer and operator entry points.
 #   make deps     install every missing Debian package (apt-get; sudo when not root)
 #   make build    configure and build into build/ (RelWithDebInfo)
-#   make test     deps + build + every test, then the unit tests again under ASan+UBSan
+#   make test     deps + build + every test, then the unit tests again under ASan+UBSan and
+#                 each fuzz target for FUZZ_SMOKE_SECONDS from its seeds
 #   make demo     build, lay out a demo home in demo-home/ and run the agent in the foreground
 #   make bench    Release build of the benchmarks, then run them
 #   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/
@@ -30,6 +31,7 @@ DEPS := cmake ninja-build g++ make pkg-config git curl \
 SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
 
 .PHONY: all deps build test test-tsan demo bench install asan tsan fuzz fuzz-build fuzz-smoke \
+        fuzz-smoke-run \
         clean format
 
 all: build
@@ -64,10 +66,11 @@ asan: deps
 	  echo "build-asan was configured with another compiler: configuring it afresh"; \
 	  rm -rf build-asan/CMakeCache.txt build-asan/CMakeFiles; \
 	fi
-	cmake -S . -B build-asan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_SANITIZE=ON \
+	cmake -S . -B build-asan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_SANITIZE=ON -DQ7_FUZZ=ON \
 	  -DCMAKE_C_COMPILER=clang -DCMAKE_CXX_COMPILER=clang++ -DQ7_BUILD_E2E=OFF -DQ7_BUILD_BENCH=OFF
 	cmake --build build-asan -j $(JOBS)
 	cd build-asan && ctest --output-on-failure -j $(JOBS) -L unit --timeout 300
+	$(MAKE) --no-print-directory fuzz-smoke-run FUZZ_DIR=build-asan
 
 tsan: deps
 	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON \
@@ -130,10 +133,13 @@ fuzz: fuzz-build
 	  $(FUZZ_OPTS_$(t)) $(CURDIR)/$(call fuzz_corpus,$(t)) $(call fuzz_seeds,$(t))$(newline))
 
 # Each target briefly from its seeds alone (new inputs go to a scratch corpus); any crash, leak,
-# hang or UBSan report fails.
-fuzz-smoke: fuzz-build
-	$(foreach t,$(FUZZ_TARGETS),rm -rf build-fuzz/smoke_$(t) && mkdir -p build-fuzz/smoke_$(t)$(newline)\
-	cd build-fuzz && $(FUZZ_ENV) bin/$(t) -max_total_time=$(FUZZ_SMOKE_SECONDS) -timeout=20 \
+# hang or UBSan report fails. FUZZ_DIR is the build holding the targets: make asan runs the
+# same from build-asan, whose libraries carry the fuzzer's coverage too.
+FUZZ_DIR ?= build-fuzz
+fuzz-smoke: fuzz-build fuzz-smoke-run
+fuzz-smoke-run:
+	$(foreach t,$(FUZZ_TARGETS),rm -rf $(FUZZ_DIR)/smoke_$(t) && mkdir -p $(FUZZ_DIR)/smoke_$(t)$(newline)\
+	cd $(FUZZ_DIR) && $(FUZZ_ENV) bin/$(t) -max_total_time=$(FUZZ_SMOKE_SECONDS) -timeout=20 \
 	  -print_final_stats=1 $(FUZZ_OPTS_$(t)) smoke_$(t) $(call fuzz_seeds,$(t))$(newline))
 
 install: build
