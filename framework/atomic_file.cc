@@ -4,6 +4,7 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
@@ -62,8 +63,7 @@ int CreateTemp(std::string* temp, bool unique) {
 int ReplaceFile(const std::string& path, std::string_view contents, const ReplaceOptions& options,
                 ReplaceResult* result, std::string* error) {
   return ReplaceFileInPieces(
-      path, [contents](const ContentSink& sink) { return sink(contents); }, options, result,
-      error);
+      path, [contents](const ContentSink& sink) { return sink(contents); }, options, result, error);
 }
 
 int ReplaceFileInPieces(const std::string& path,
@@ -115,6 +115,14 @@ int ReplaceFileInPieces(const std::string& path,
     ::close(dir);
   }
   return kOk;
+}
+
+std::string SetFileAside(const std::string& path) {
+  const std::string aside = path + ".bad";
+  if (::rename(path.c_str(), aside.c_str()) != 0) {
+    return "";
+  }
+  return aside;
 }
 
 }  // namespace fw

@@ -53,8 +53,14 @@ using ContentSink = std::function<bool(std::string_view piece)>;
 // The same replacement with contents produced in pieces, so that a large file never has to be
 // held whole in memory: produce(sink) calls sink for each piece in order and returns false when
 // a piece could not be written (or it could not make one; errno then says why).
-int ReplaceFileInPieces(const std::string& path, const std::function<bool(const ContentSink&)>& produce,
+int ReplaceFileInPieces(const std::string& path,
+                        const std::function<bool(const ContentSink&)>& produce,
                         const ReplaceOptions& options = {}, ReplaceResult* result = nullptr,
                         std::string* error = nullptr);
+
+// Moves a file that failed to load out of the way, to path + ".bad" (replacing an older one),
+// so that the agent starts without it and an operator can still look at it. Returns the new
+// path, or "" with errno set when the rename failed.
+std::string SetFileAside(const std::string& path);
 
 }  // namespace fw

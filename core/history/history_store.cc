@@ -1,6 +1,7 @@
 #include "core/history/history_store.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -118,9 +119,8 @@ bool HistoryStore::saveInterval(int64_t interval, std::string_view stem, const v
                               });
 }
 
-bool HistoryStore::saveIntervalInPieces(int64_t interval, std::string_view stem,
-                                        size_t record_size, size_t count,
-                                        const RecordFill& fill) const {
+bool HistoryStore::saveIntervalInPieces(int64_t interval, std::string_view stem, size_t record_size,
+                                        size_t count, const RecordFill& fill) const {
   static const char* const kWhere = "HistoryStore::saveInterval";
   if (interval < 0) {
     CLOG::error("%s negative interval start %lld for %.*s", kWhere,
@@ -217,22 +217,31 @@ std::vector<std::byte> HistoryStore::loadInterval(int64_t interval, std::string_
 }
 
 int HistoryStore::cleanupOldFiles(int64_t now, int64_t summary_seconds) const {
-  static const char* const kWhere = "HistoryStore::cleanupOldFiles";
-  namespace fs = std::filesystem;
   const int64_t oldest_kept = now - summary_seconds;
+  return removeFiles([oldest_kept](int64_t start) { return start < oldest_kept; },
+                     "HistoryStore::cleanupOldFiles");
+}
+
+int HistoryStore::removeIntervalsAfter(int64_t last_kept) const {
+  return removeFiles([last_kept](int64_t start) { return start > last_kept; },
+                     "HistoryStore::removeIntervalsAfter");
+}
+
+int HistoryStore::removeFiles(const std::function<bool(int64_t)>& remove, const char* where) const {
+  namespace fs = std::filesystem;
   int removed = 0;
   std::error_code ec;
   fs::directory_iterator it(directory_, ec);
   if (ec) {
     if (ec != std::errc::no_such_file_or_directory) {
-      CLOG::error("%s cannot list %s: %s", kWhere, directory_.c_str(), ec.message().c_str());
+      CLOG::error("%s cannot list %s: %s", where, directory_.c_str(), ec.message().c_str());
     }
     return 0;
   }
   for (; !ec && it != fs::directory_iterator(); it.increment(ec)) {
     const std::string name = it->path().filename().string();
     const std::optional<int64_t> start = IntervalOfStoreFile(name);
-    if (!start || *start >= oldest_kept) {
+    if (!start || !remove(*start)) {
       continue;
     }
     // A directory or link that happens to carry such a name is not ours.
@@ -242,17 +251,42 @@ int HistoryStore::cleanupOldFiles(int64_t now, int64_t summary_seconds) const {
     }
     const std::string path = it->path().string();
     if (::unlink(path.c_str()) != 0) {
-      CLOG::error("%s cannot remove %s: %s", kWhere, path.c_str(), std::strerror(errno));
+      CLOG::error("%s cannot remove %s: %s", where, path.c_str(), std::strerror(errno));
       continue;
     }
     Advance();
-    CLOG::med("%s removed %s", kWhere, path.c_str());
+    CLOG::med("%s removed %s", where, path.c_str());
     ++removed;
   }
   if (ec) {
-    CLOG::error("%s listing %s stopped: %s", kWhere, directory_.c_str(), ec.message().c_str());
+    CLOG::error("%s listing %s stopped: %s", where, directory_.c_str(), ec.message().c_str());
   }
   return removed;
+}
+
+bool HistoryStore::truncateInterval(int64_t interval, std::string_view stem, off_t bytes) const {
+  const std::string path = pathOf(interval, stem);
+  struct stat st {};
+  if (::stat(path.c_str(), &st) != 0) {
+    if (errno == ENOENT && bytes == 0) {
+      return true;
+    }
+    CLOG::error("%s cannot examine %s: %s", "HistoryStore::truncateInterval", path.c_str(),
+                std::strerror(errno));
+    return false;
+  }
+  if (st.st_size <= bytes) {
+    return true;  // nothing was written after that length
+  }
+  if (::truncate(path.c_str(), bytes) != 0) {
+    CLOG::error("%s cannot cut %s back to %lld bytes: %s", "HistoryStore::truncateInterval",
+                path.c_str(), static_cast<long long>(bytes), std::strerror(errno));
+    return false;
+  }
+  Advance();
+  CLOG::min("%s cut %s back from %lld to %lld bytes", "HistoryStore::truncateInterval",
+            path.c_str(), static_cast<long long>(st.st_size), static_cast<long long>(bytes));
+  return true;
 }
 
 }  // namespace history

@@ -17,6 +17,8 @@
 // of the same interval and stem must not overlap (they share a temporary name), nor a save with a
 // cleanup that could remove its temporary file; the analyzer's tree lock serialises all writers.
 
+#include <sys/types.h>
+
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -76,6 +78,14 @@ class HistoryStore {
   // of files removed; each removal is traced at detail level.
   int cleanupOldFiles(int64_t now, int64_t summary_seconds) const;
 
+  // Removes the files of every stem whose interval starts after last_kept: what a run wrote
+  // after its last checkpoint, which a recovery replays. Returns the number removed.
+  int removeIntervalsAfter(int64_t last_kept) const;
+  // Cuts the file of interval and stem back to bytes when it is longer (an instance file
+  // appended to after a checkpoint). A missing file is fine when bytes is 0. False, traced,
+  // when it could not be examined or cut.
+  bool truncateInterval(int64_t interval, std::string_view stem, off_t bytes) const;
+
   // A count of the changes every store of the process has made to its files (saves, removals),
   // advanced once a change is in place: what was read after seeing one value reflects every
   // change counted up to it, so a reader keeping what it derived from the files can tell when
@@ -83,6 +93,9 @@ class HistoryStore {
   static uint64_t generation();
 
  private:
+  // Removes the store's regular files whose interval start remove() accepts; traced as where.
+  int removeFiles(const std::function<bool(int64_t)>& remove, const char* where) const;
+
   std::string directory_;  // history directory, without a trailing '/'
 };
 
