@@ -31,7 +31,7 @@ DEPS := cmake ninja-build g++ make pkg-config git curl \
 SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
 
 .PHONY: all deps build test test-tsan demo bench install asan tsan fuzz fuzz-build fuzz-smoke \
-        fuzz-smoke-run \
+        fuzz-smoke-run soak \
         clean format
 
 all: build
@@ -96,6 +96,13 @@ bench: deps
 	cmake --build build-release -j $(JOBS)
 	@for b in build-release/bin/bench_*; do [ -x "$$b" ] && "$$b"; done; true
 	bench/q7bench_series.sh build-release/bin/bench_q7bench 5
+
+# The kill loop at length: the agent killed SOAK_KILLS times (runs of up to SOAK_MAX_MS each)
+# while the simulated collector writes 2,000 records a second; make test runs 10 kills.
+SOAK_KILLS ?= 200
+SOAK_MAX_MS ?= 8000
+soak: build
+	Q7_KILLS=$(SOAK_KILLS) Q7_KILL_MAX_MS=$(SOAK_MAX_MS) build/bin/crash_e2e_test
 
 FUZZ_SECONDS ?= 60
 FUZZ_SMOKE_SECONDS ?= 20

@@ -70,6 +70,14 @@ void applyAgentProperties() {
       std::strtol(AgentProperties::getAgentProperty("KQ7OVERTIMEINTERVAL").c_str(), nullptr, 10)));
   CConfig::setSummaryInterval(static_cast<int>(
       std::strtol(AgentProperties::getAgentProperty("KQ7SUMMARYINTERVAL").c_str(), nullptr, 10)));
+  // Unset keeps the default; set, it must be a number of seconds (0 turns checkpoints off).
+  if (const std::string checkpoint = AgentProperties::getAgentProperty("KQ7CHECKPOINTSECONDS");
+      !checkpoint.empty()) {
+    char* end = nullptr;
+    const long seconds = std::strtol(checkpoint.c_str(), &end, 10);
+    CConfig::setCheckpointSeconds(*end == '\0' && seconds <= 86400 ? static_cast<int>(seconds)
+                                                                   : -1);
+  }
 }
 
 int LoadAgents() {

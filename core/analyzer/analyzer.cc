@@ -82,6 +82,10 @@ bool CAnalyzer::addBatch(const _TYPED_TRANSACTION* items, size_t n) {
   return true;
 }
 
+void CAnalyzer::markPosition(const ReadPosition& position) {
+  add(_TYPED_TRANSACTION{TRANSACTION_KIND_POSITION, new CPositionMark(position)});
+}
+
 void CAnalyzer::Shutdown() {
   shutdownRequested.store(true);
   if (newQueue && !newQueue->IsFull()) {

@@ -33,6 +33,9 @@ class CAnalyzer : public TransactionSink {
   // The same for a batch, put in with one lock per stretch of room.
   bool addBatch(const _TYPED_TRANSACTION* items, size_t n) override;
 
+  // Queues a CPositionMark behind the records queued so far.
+  void markPosition(const ReadPosition& position) override;
+
   // Asks the analyzer thread to finish. Besides setting the flag its loop polls, it queues an
   // empty item so that a thread waiting on an idle queue notices at once.
   void Shutdown();
@@ -84,7 +87,7 @@ class CAnalyzer : public TransactionSink {
   std::atomic<bool> shutdownRequested{false};
   std::atomic<int32_t> transactionsProcessed{0};
   std::atomic<int32_t> transactionsIgnored{0};
-  std::atomic<int64_t> transactionsTaken{0};    // analyzer thread writes, anyone reads
+  std::atomic<int64_t> transactionsTaken{0};  // analyzer thread writes, anyone reads
   std::atomic<long> heldItems{0};  // of the analyzer's current batch; it writes, anyone reads
   std::atomic<int64_t> totalProcessingTime{0};  // ms
   int32_t oldTransactions = 0;       // restamped into this interval; analyzer thread only

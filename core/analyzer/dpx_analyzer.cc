@@ -12,6 +12,7 @@
 #include "core/analyzer/intake/dpx_transaction.h"
 #include "core/analyzer/situation_controller.h"
 #include "core/config/cconfig.h"
+#include "core/history/checkpoint_file.h"
 #include "core/history/history_store.h"
 #include "core/history/instance_file.h"
 #include "core/history/state_file.h"
@@ -34,6 +35,9 @@ CDPXAnalyzer::Paths DefaultPaths() {
   paths.historyDirectory = CConfig::getDpxOdiDataDirectory();
   paths.stateFile = std::string(CConfig::getBaseDirectory()) + "/q7state.properties";
   paths.dataDirectory = CConfig::getDpxDataDirectory();
+  if (CConfig::getCheckpointSeconds() > 0) {
+    paths.checkpointFile = std::string(CConfig::getBaseDirectory()) + "/q7checkpoint.dat";
+  }
   return paths;
 }
 
@@ -75,6 +79,9 @@ CDPXAnalyzer::CDPXAnalyzer(Paths p)
                                                               sizeof(kq7_q7subtxins_data_t))),
       summaryFolds(std::make_unique<SummaryFolds>()) {
   state->load();
+  if (!paths.checkpointFile.empty()) {
+    checkpointFile = std::make_unique<history::CheckpointFile>(paths.checkpointFile);
+  }
 }
 
 CDPXAnalyzer::~CDPXAnalyzer() {
@@ -96,10 +103,13 @@ void CDPXAnalyzer::startRun() {
   cleanupOldFiles();
   CvelMutexLock lock(treeMutex);
   // The current interval's rows saved by an earlier run stay the current trees, so a restart
-  // within an interval keeps its data.
-  cache->loadCurrent(getCurrentOverTimeInterval());
+  // within an interval keeps its data; a checkpoint, when there is one, is newer.
+  if (!recoverFromCheckpoint()) {
+    cache->loadCurrent(getCurrentOverTimeInterval());
+  }
   referenceInterval = getCurrentOverTimeInterval();
   rolloverCount = 0;
+  lastCheckpointAt = fw::Now();
 }
 
 void CDPXAnalyzer::rollover() {
@@ -126,6 +136,9 @@ void CDPXAnalyzer::rollover() {
   }
   cache->replaceCurrent(std::move(fresh));
   referenceInterval = getCurrentOverTimeInterval();
+  // The ended interval's rows are saved with the records after the last checkpoint in them;
+  // the next checkpoint, at the next position noted, makes them final.
+  checkpointDue = true;
   if (++rolloverCount % kCleanupEveryRollovers == 0) {
     cleanupOldFiles();
   }
@@ -141,19 +154,28 @@ void CDPXAnalyzer::finishRun() {
     flushInstanceFile();
     flushSubInstanceFile();
   }
+  // A clean stop is a last checkpoint: the next start resumes exactly here.
+  writeCheckpoint();
   state->save();
 }
 
 void CDPXAnalyzer::Run() {
   static const char* const kWhere = "CDPXAnalyzer::Run";
+  // The checkpoint is read first: it says where the file manager resumes.
+  startRun();
   if (!paths.dataDirectory.empty()) {
     auto manager = std::make_unique<CDPXFileManager>();
     manager->setDirToWatch(paths.dataDirectory.c_str());
     manager->setSink(this);
+    if (!resumeAt.file.empty()) {
+      position = LocateReadPosition(resumeAt, paths.dataDirectory.c_str());
+      manager->resumeAt(position.file.c_str(), position.offset, position.device, position.inode);
+    } else {
+      position = {manager->getLastProcessedFileName(), 0, 0, manager->getLastProcessedOffset()};
+    }
     feeder = std::move(manager);
     feeder->start();
   }
-  startRun();
   bool shutdownSeen = false;
   // Stops the feeder at shutdown. It runs beside this loop because a reader may be blocked on
   // the full queue, which only this loop empties.
@@ -198,6 +220,11 @@ void CDPXAnalyzer::Run() {
       item = batch[batchNext++];
     }
     heldItems.store(batchSize - batchNext);
+    if (item.transaction != nullptr && item.type == TRANSACTION_KIND_POSITION) {
+      notePosition(static_cast<const CPositionMark*>(item.transaction)->position());
+      delete item.transaction;
+      continue;
+    }
     // An item without a transaction only wakes the loop (Shutdown queues one).
     const bool got = item.transaction != nullptr;
     if (got && item.type != TRANSACTION_KIND_DPX) {

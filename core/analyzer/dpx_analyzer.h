@@ -20,6 +20,7 @@
 #include "core/analyzer/analysis/over_time_trees.h"
 #include "core/analyzer/analysis/table_queries.h"
 #include "core/analyzer/analyzer.h"
+#include "core/analyzer/intake/read_position.h"
 #include "core/runtime/cvel_mutex.h"
 #include "core/runtime/cvel_thread.h"
 #include "framework/thread_annotations.h"
@@ -30,6 +31,7 @@ struct SummaryFolds;
 template <class SummaryRow>
 class SummaryFoldCache;
 namespace history {
+class CheckpointFile;
 class HistoryStore;
 class InstanceFile;
 class StateFile;
@@ -42,6 +44,7 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
     std::string historyDirectory;  // over-time history, instance and pattern files
     std::string stateFile;         // the last-history-sent state
     std::string dataDirectory;     // where the collector writes; empty: no file manager
+    std::string checkpointFile;    // the checkpoint; empty: none taken or read
   };
 
   // The singleton, created on first use; GetInstance also starts its thread.
@@ -114,10 +117,24 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
     return rolloverCount;
   }
 
-  // Start-of-run work (interval, cleanup, the current interval's saved rows) and end-of-run
-  // work (save everything), as Run does them; tests drive them directly.
+  // Start-of-run work (interval, cleanup, the current interval's rows: the checkpoint's when
+  // there is one, else the saved ones) and end-of-run work (save everything, a last
+  // checkpoint), as Run does them; tests drive them directly.
   void startRun();
   void finishRun();
+
+  // ---- Checkpoints (checkpointing.cc). Analyzer thread. ----
+  // Takes note that every record before position is processed (a CPositionMark), and takes a
+  // checkpoint when one is due.
+  void notePosition(const ReadPosition& position);
+  // Saves the checkpoint now: the current interval's rows, the position noted last, the
+  // instance files' lengths and the patterns' counters. False (traced) when it could not be
+  // written; the next is tried at the next due time.
+  bool writeCheckpoint();
+  // Where startRun's checkpoint says reading resumes; empty file name without one.
+  const ReadPosition& resumePosition() const {
+    return resumeAt;
+  }
 
  protected:
   void Run() override;
@@ -140,6 +157,9 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
                                                 SummaryFoldCache<SummaryRow>& folds,
                                                 const char* where, int sampleType, int* count,
                                                 std::size_t limit) EXCLUDES(treeMutex);
+  // Loads the checkpoint and puts everything back as it stood then; false when there is none
+  // (or it was set aside), leaving everything untouched.
+  bool recoverFromCheckpoint() REQUIRES(treeMutex);
   void saveIntervalData(long interval) REQUIRES(treeMutex);
   void saveAllData(long interval) REQUIRES(treeMutex);
   void cleanupOldFiles();
@@ -163,4 +183,12 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
 
   int rolloverCount = 0;        // analyzer thread
   short lastInstanceLevel = 0;  // analyzer thread: the level of the last page
+
+  // Checkpoints; all analyzer thread. Null file: checkpoints are off.
+  std::unique_ptr<history::CheckpointFile> checkpointFile;
+  ReadPosition position;  // every record before it is in the trees
+  ReadPosition resumeAt;  // the recovered checkpoint's position
+  uint64_t checkpointSequence = 0;
+  long lastCheckpointAt = 0;   // when the last one was tried, seconds since 1970
+  bool checkpointDue = false;  // a rollover happened since the last one
 };

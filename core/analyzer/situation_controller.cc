@@ -323,8 +323,8 @@ bool CSituationController::addClientPattern(std::unique_ptr<ClientPattern>&& pat
 
 template <typename Pattern>
 std::optional<Pattern> CSituationController::findOverlap(
-    const Pattern& candidate, const std::vector<Entry<Pattern>> CSituationController::*entries)
-    const {
+    const Pattern& candidate,
+    const std::vector<Entry<Pattern>> CSituationController::*entries) const {
   using K = Kind<Pattern>;
   // Deciding an overlap can take milliseconds for long patterns; the search runs on copies so
   // that matching never waits for it.
@@ -521,6 +521,36 @@ std::vector<TransactionPattern> CSituationController::getTransactionPatterns() c
   return out;
 }
 
+std::vector<PatternCounter> CSituationController::getPatternCounters() const {
+  CvelMutexLock lock(mutex_);
+  std::vector<PatternCounter> out;
+  out.reserve(transactions_.size());
+  for (const Entry<TransactionPattern>& e : transactions_) {
+    const TransactionPattern& p = *e.pattern;
+    out.push_back({p.situationId, p.applicationPattern, p.transactionPattern, p.matchedCount,
+                   p.sampledCount});
+  }
+  return out;
+}
+
+int CSituationController::restorePatternCounters(const std::vector<PatternCounter>& counters) {
+  CvelMutexLock lock(mutex_);
+  int set = 0;
+  for (const PatternCounter& c : counters) {
+    for (Entry<TransactionPattern>& e : transactions_) {
+      TransactionPattern& p = *e.pattern;
+      if (c.situationId == p.situationId && c.applicationPattern == p.applicationPattern &&
+          c.transactionPattern == p.transactionPattern) {
+        p.matchedCount = c.matched;
+        p.sampledCount = c.sampled;
+        ++set;
+        break;
+      }
+    }
+  }
+  return set;
+}
+
 std::vector<ClientPattern> CSituationController::getClientPatterns() const {
   CvelMutexLock lock(mutex_);
   std::vector<ClientPattern> out;
@@ -552,7 +582,8 @@ void CSituationController::reindex(const std::vector<Entry<Pattern>>& entries) {
   std::vector<std::pair<PatternIndex::Field, PatternIndex::Field>> pairs;
   pairs.reserve(entries.size());
   for (const Entry<Pattern>& e : entries) {
-    pairs.push_back({{K::first(*e.pattern), e.first.get()}, {K::second(*e.pattern), e.second.get()}});
+    pairs.push_back(
+        {{K::first(*e.pattern), e.first.get()}, {K::second(*e.pattern), e.second.get()}});
   }
   indexOf(entries).build(pairs);
 }

@@ -88,6 +88,17 @@ struct ClientPattern {
   char situationId[kSituationIdWidth] = {};
 };
 
+// A transaction pattern's counters, named by its situation and its two patterns, as a
+// checkpoint keeps them: sampling takes every n-th match, so a resumed run must go on counting
+// where the checkpoint's run was.
+struct PatternCounter {
+  std::string situationId;
+  std::string applicationPattern;
+  std::string transactionPattern;
+  uint32_t matched = 0;
+  uint32_t sampled = 0;
+};
+
 // A match result: a singly linked list of copies of the matching patterns, in matching order,
 // taken under the controller's lock (counters as they stood right after this match). The list
 // belongs to the caller until it hands it to CSituationController::freeTransactionMatches or
@@ -155,6 +166,12 @@ class CSituationController {
   // Copies of every stored pattern in matching order, for the pattern tables.
   std::vector<TransactionPattern> getTransactionPatterns() const;
   std::vector<ClientPattern> getClientPatterns() const;
+
+  // The counters of every stored transaction pattern, in matching order.
+  std::vector<PatternCounter> getPatternCounters() const;
+  // Sets the counters of each stored transaction pattern that counters names (same situation
+  // and patterns); the others keep theirs. Returns how many were set.
+  int restorePatternCounters(const std::vector<PatternCounter>& counters);
 
   // Reads each pattern file whose modification time is later than when this controller last
   // read or wrote it, replacing the patterns held with the file's (in the file's order, counters
@@ -230,7 +247,7 @@ class CSituationController {
   mutable CvelMutex mutex_;
   std::vector<Entry<TransactionPattern>> transactions_ GUARDED_BY(mutex_);  // matching order
   std::vector<Entry<ClientPattern>> clients_ GUARDED_BY(mutex_);            // insertion order
-  PatternIndex transactionIndex_ GUARDED_BY(mutex_);  // over transactions_
-  PatternIndex clientIndex_ GUARDED_BY(mutex_);       // over clients_
-  std::vector<uint32_t> candidates_ GUARDED_BY(mutex_);  // matching's scratch
+  PatternIndex transactionIndex_ GUARDED_BY(mutex_);                        // over transactions_
+  PatternIndex clientIndex_ GUARDED_BY(mutex_);                             // over clients_
+  std::vector<uint32_t> candidates_ GUARDED_BY(mutex_);                     // matching's scratch
 };

@@ -15,6 +15,7 @@
 
 int CConfig::VOverTimeInterval = CConfig::kDefaultOverTimeInterval;
 int CConfig::VSummaryInterval = CConfig::kDefaultSummaryInterval;
+int CConfig::VCheckpointSeconds = CConfig::kDefaultCheckpointSeconds;
 int CConfig::VExcludeOutlierMillis = CConfig::kNoOutlierLimit;
 int CConfig::VMaxThreads = CConfig::kDefaultMaxThreads;
 bool CConfig::VReportZeroRecords = false;
@@ -152,12 +153,23 @@ void CConfig::setOverTimeInterval(int minutes) {
   CLOG::min("Overtime Interval set to %d", VOverTimeInterval);
 }
 
+void CConfig::setCheckpointSeconds(int seconds) {
+  VCheckpointSeconds = seconds;
+  if (seconds < 0) {
+    CLOG::error("Invalid checkpoint interval %d", seconds);
+    VCheckpointSeconds = kDefaultCheckpointSeconds;
+  }
+  CLOG::min("Checkpoint interval set to %d seconds%s", VCheckpointSeconds,
+            VCheckpointSeconds == 0 ? " (checkpoints off)" : "");
+}
+
 void CConfig::setSummaryInterval(int hours) {
   VSummaryInterval = hours;
   if (hours == 0) {
     // The over-time text is reused here deliberately.
     CLOG::error("Invalid Overtime Interval %d", hours);
     VSummaryInterval = kDefaultSummaryInterval;
+    VCheckpointSeconds = kDefaultCheckpointSeconds;
   }
   CLOG::min("Summary Interval set to %d", VSummaryInterval);
 }

@@ -18,12 +18,15 @@ class CConfig {
   static constexpr int kDefaultSummaryInterval = 24;  // hours
   static constexpr int kDefaultMaxThreads = 40;
   static constexpr int kNoOutlierLimit = -1;
+  static constexpr int kDefaultCheckpointSeconds = 10;
 
   static int getOverTimeInterval() { return VOverTimeInterval; }
   static int getSummaryInterval() { return VSummaryInterval; }
   static int getExcludeOutlierMillis() { return VExcludeOutlierMillis; }
   static int getMaxThreads() { return VMaxThreads; }
   static bool getReportZeroRecords() { return VReportZeroRecords; }
+  // Seconds between the analyzer's checkpoints; 0: none are taken or read.
+  static int getCheckpointSeconds() { return VCheckpointSeconds; }
   static const char* getBaseDirectory() { return baseDirectory; }
   static const char* getLogDirectory() { return logDirectory; }
   static const char* getOdiDataDirectory() { return odiDataDirectory; }
@@ -56,6 +59,9 @@ class CConfig {
   // Stores the limit unchanged; -1 means no limit.
   static void setExcludeOutlierMillis(int millis) { VExcludeOutlierMillis = millis; }
   static void setReportZeroRecords(bool on) { VReportZeroRecords = on; }
+  // Negative is invalid: logged as an error and replaced by the default. 0 turns checkpoints
+  // off.
+  static void setCheckpointSeconds(int seconds);
 
   // Restores every default and empties the directories, as at process start.
   static void resetForTesting();
@@ -66,6 +72,7 @@ class CConfig {
   static int VExcludeOutlierMillis;  // drop transactions at or above this; -1: no limit
   static int VMaxThreads;            // thread limit; no one reads it
   static bool VReportZeroRecords;    // report zero-record rows for some tables
+  static int VCheckpointSeconds;     // seconds between checkpoints; 0: none
 
   static char baseDirectory[kDirSize];        // agent base directory
   static char logDirectory[kDirSize];         // base + "/logs/"

@@ -44,9 +44,11 @@ class AnalyzerFixture : public ::testing::Test {
   // An analyzer on the test's directories; begun as its thread would begin unless it is to
   // run as a thread. No data directory: the tests hand transactions over themselves, and no
   // file manager runs.
-  std::unique_ptr<CDPXAnalyzer> NewAnalyzer(bool begin = true) {
+  // With checkpoints set, it takes and reads a checkpoint in the test's directory.
+  std::unique_ptr<CDPXAnalyzer> NewAnalyzer(bool begin = true, bool checkpoints = false) {
     auto analyzer = std::make_unique<CDPXAnalyzer>(
-        CDPXAnalyzer::Paths{dir_.file("dpx"), dir_.file("q7state.properties"), ""});
+        CDPXAnalyzer::Paths{dir_.file("dpx"), dir_.file("q7state.properties"), "",
+                            checkpoints ? dir_.file("q7checkpoint.dat") : ""});
     if (begin) {
       analyzer->startRun();
     }

@@ -1,8 +1,10 @@
 #include "core/analyzer/analysis/over_time_trees.h"
 
 #include <cstring>
+#include <memory>
 
 #include "core/analyzer/rows/rows.h"
+#include "core/history/checkpoint_file.h"
 #include "core/history/history_store.h"
 #include "core/runtime/clog.h"
 
@@ -14,24 +16,37 @@ bool SaveTree(TSAVLTree& tree, history::HistoryStore& store, long interval, cons
   std::vector<TreeNode*> nodes;
   getTreeNodes(tree, nodes);
   // A stretch of rows at a time: a copy of the whole tree would double the peak memory.
-  return store.saveIntervalInPieces(
-      interval, stem, sizeof(Layout), nodes.size(), [&nodes](size_t first, size_t n, void* out) {
-        Layout* const rows = static_cast<Layout*>(out);
-        for (size_t i = 0; i < n; ++i) {
-          static_cast<Row*>(nodes[first + i])->getQ7Struct(rows[i]);
-        }
-      });
+  return store.saveIntervalInPieces(interval, stem, sizeof(Layout), nodes.size(),
+                                    [&nodes](size_t first, size_t n, void* out) {
+                                      Layout* const rows = static_cast<Layout*>(out);
+                                      for (size_t i = 0; i < n; ++i) {
+                                        static_cast<Row*>(nodes[first + i])->getQ7Struct(rows[i]);
+                                      }
+                                    });
 }
 
 template <class Row>
-void LoadTree(COverTimeTrees& trees, OverTimeTable table, history::HistoryStore& store,
-              long interval, const char* stem) {
+history::RecordSection TreeSection(TSAVLTree& tree, const char* stem) {
   using Layout = typename Row::LayoutType;
-  const std::vector<std::byte> bytes = store.loadInterval(interval, stem, sizeof(Layout));
-  const size_t count = bytes.size() / sizeof(Layout);
+  auto nodes = std::make_shared<std::vector<TreeNode*>>();
+  getTreeNodes(tree, *nodes);
+  const size_t count = nodes->size();
+  return {stem, sizeof(Layout), count, [nodes](size_t first, size_t n, void* out) {
+            Layout* const rows = static_cast<Layout*>(out);
+            for (size_t i = 0; i < n; ++i) {
+              static_cast<Row*>((*nodes)[first + i])->getQ7Struct(rows[i]);
+            }
+          }};
+}
+
+// Adds count records of Row's layout to table; where and interval name them in the trace.
+template <class Row>
+void AddRecords(COverTimeTrees& trees, OverTimeTable table, const std::byte* records, size_t count,
+                const char* stem, long interval) {
+  using Layout = typename Row::LayoutType;
   for (size_t i = 0; i < count; ++i) {
     Layout layout;
-    memcpy(&layout, bytes.data() + i * sizeof(Layout), sizeof(Layout));
+    memcpy(&layout, records + i * sizeof(Layout), sizeof(Layout));
     auto row = std::make_unique<Row>(layout);
     if (trees.add(table, row.get(), row->indexHash())) {
       row.release();  // the tree owns it now
@@ -40,6 +55,20 @@ void LoadTree(COverTimeTrees& trees, OverTimeTable table, history::HistoryStore&
                 "COverTimeTrees::load", stem, interval);
     }
   }
+}
+
+template <class Row>
+void LoadTree(COverTimeTrees& trees, OverTimeTable table, history::HistoryStore& store,
+              long interval, const char* stem) {
+  using Layout = typename Row::LayoutType;
+  const std::vector<std::byte> bytes = store.loadInterval(interval, stem, sizeof(Layout));
+  AddRecords<Row>(trees, table, bytes.data(), bytes.size() / sizeof(Layout), stem, interval);
+}
+
+template <class Row>
+void LoadSection(COverTimeTrees& trees, OverTimeTable table, const std::byte* records, size_t count,
+                 const char* stem) {
+  AddRecords<Row>(trees, table, records, count, stem, -1);
 }
 
 template <class Row>
@@ -60,14 +89,23 @@ void SeedTree(COverTimeTrees& trees, OverTimeTable table, TSAVLTree& ended, long
 
 struct TableOps {
   const char* stem;
+  size_t recordSize;
   bool (*save)(TSAVLTree&, history::HistoryStore&, long, const char*);
   void (*load)(COverTimeTrees&, OverTimeTable, history::HistoryStore&, long, const char*);
   void (*seed)(COverTimeTrees&, OverTimeTable, TSAVLTree&, long);
+  history::RecordSection (*section)(TSAVLTree&, const char*);
+  void (*loadSection)(COverTimeTrees&, OverTimeTable, const std::byte*, size_t, const char*);
 };
 
 template <class Row>
 constexpr TableOps Ops(const char* stem) {
-  return {stem, &SaveTree<Row>, &LoadTree<Row>, &SeedTree<Row>};
+  return {stem,
+          sizeof(typename Row::LayoutType),
+          &SaveTree<Row>,
+          &LoadTree<Row>,
+          &SeedTree<Row>,
+          &TreeSection<Row>,
+          &LoadSection<Row>};
 }
 
 // In OverTimeTable order: the list's.
@@ -115,6 +153,28 @@ void COverTimeTrees::load(history::HistoryStore& store, long interval) {
   for (int i = 0; i < kOverTimeTables; ++i) {
     kTables[i].load(*this, static_cast<OverTimeTable>(i), store, interval, kTables[i].stem);
   }
+}
+
+std::vector<history::RecordSection> COverTimeTrees::sections() const {
+  std::vector<history::RecordSection> out;
+  for (int i = 0; i < kOverTimeTables; ++i) {
+    out.push_back(kTables[i].section(*trees_[i], kTables[i].stem));
+  }
+  return out;
+}
+
+bool COverTimeTrees::loadSection(const history::LoadedSection& section) {
+  for (int i = 0; i < kOverTimeTables; ++i) {
+    if (section.stem == kTables[i].stem) {
+      if (section.record_size != kTables[i].recordSize) {
+        return false;
+      }
+      kTables[i].loadSection(*this, static_cast<OverTimeTable>(i), section.records.data(),
+                             section.count(), kTables[i].stem);
+      return true;
+    }
+  }
+  return false;
 }
 
 void COverTimeTrees::seedZeroRows(const COverTimeTrees& ended, long interval) {

@@ -16,7 +16,9 @@
 
 namespace history {
 class HistoryStore;
-}
+struct LoadedSection;
+struct RecordSection;
+}  // namespace history
 
 // The over-time tables in their list's order (rows/analyzer_tables.h): the order transaction
 // processing updates a page's tables, then the sub-transaction table. Also the index into
@@ -58,6 +60,12 @@ class COverTimeTrees {
   bool save(history::HistoryStore& store, long interval) const;
   // Adds interval's history rows to the trees.
   void load(history::HistoryStore& store, long interval);
+  // Every tree's rows as history records, one section per table (stem "q7<table>"), for a
+  // checkpoint. The sections point into the trees: use them before the trees change.
+  std::vector<history::RecordSection> sections() const;
+  // Adds records saved by sections() to the tree of stem; false for a stem no table has or a
+  // record size that is not the table's.
+  bool loadSection(const history::LoadedSection& section);
   // Adds, for every key of ended, a row with no requests starting at interval.
   void seedZeroRows(const COverTimeTrees& ended, long interval);
 

@@ -1,5 +1,7 @@
 #include "core/analyzer/intake/data_file_monitor.h"
 
+#include <sys/stat.h>
+
 #include <cerrno>
 #include <cstdio>
 #include <new>
@@ -50,6 +52,13 @@ void CDataFileMonitor::setLastProcessedOffset(long long offset) {
   readToOffset.store(offset);
 }
 
+bool CDataFileMonitor::identityChanged() const {
+  struct stat st {};
+  return readInode != 0 && ::stat(file.c_str(), &st) == 0 &&
+         (static_cast<uint64_t>(st.st_dev) != readDevice ||
+          static_cast<uint64_t>(st.st_ino) != readInode);
+}
+
 std::unique_ptr<char[]> CDataFileMonitor::getNewFileContents(long* length, long long* newOffset) {
   static const char* const kWhere = "getNewFileContents";
   long long size = 0;
@@ -84,6 +93,18 @@ std::unique_ptr<char[]> CDataFileMonitor::getNewFileContents(long* length, long 
   if (!in) {
     CLOG::error("%s ERROR: Open of file[%s] failed[%d]\n", kWhere, file.c_str(), errno);
     return nullptr;
+  }
+  struct stat identity {};
+  if (::fstat(fileno(in.get()), &identity) == 0) {
+    const auto device = static_cast<uint64_t>(identity.st_dev);
+    const auto inode = static_cast<uint64_t>(identity.st_ino);
+    if (readInode != 0 && (device != readDevice || inode != readInode)) {
+      // Renamed between the size check and the open: the offset belongs to the old file.
+      CLOG::med("%s [%s] is no longer the file read so far; not read", kWhere, file.c_str());
+      return nullptr;
+    }
+    readDevice = device;
+    readInode = inode;
   }
   if (fseeko(in.get(), static_cast<off_t>(offset), SEEK_SET) != 0) {
     CLOG::error("%s fseek to offset[%lld] failed errno[%d]", kWhere, offset, errno);

@@ -46,6 +46,19 @@ class CDataFileMonitor : public CvelThread {
   long long getLastProcessedOffset() const { return lastProcessedOffset.load(); }
   void setFile(const char* file) { this->file = file; }
   const char* getFile() const { return file.c_str(); }
+  // The device and inode of the file the last chunk came from (0 before the first read): the
+  // file itself, whatever it is called by the time a checkpoint is resumed. Thread body only.
+  uint64_t getReadDevice() const { return readDevice; }
+  uint64_t getReadInode() const { return readInode; }
+  // Says which file the offset belongs to (a checkpoint's), so that a file renamed before the
+  // first read is not read from that offset; 0, 0 forgets it (a new file). Owner before Start,
+  // then the thread body.
+  void setReadIdentity(uint64_t device, uint64_t inode) {
+    readDevice = device;
+    readInode = inode;
+  }
+  // True when the name now holds another file than the one read so far.
+  bool identityChanged() const;
   void setExcludeOutlierMillis(int millis) { excludeOutlierMillis = millis; }
   int getExcludeOutlierMillis() const { return excludeOutlierMillis; }
 
@@ -64,4 +77,6 @@ class CDataFileMonitor : public CvelThread {
   std::atomic<long long> lastProcessedOffset{0};
   std::atomic<long long> readToOffset{0};  // end of the last chunk read; as above
   int excludeOutlierMillis = -1;           // response-time limit in ms; -1: no test
+  uint64_t readDevice = 0;                 // of the last chunk's file; thread body
+  uint64_t readInode = 0;                  // as readDevice
 };

@@ -2,6 +2,7 @@
 // handling, the outlier test and the stop at an analyzer shutdown.
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <cstdio>
 #include <filesystem>
@@ -145,6 +146,70 @@ TEST_F(DataFileMonitorTest, RenamedFileIsFinishedThenLiveNameRestarts) {
   monitor.Shutdown();
   monitor.Join();
   EXPECT_EQ(sizeOf(live), monitor.getLastProcessedOffset());
+
+  // Each file's records are followed by a mark of where they end, naming the file as it was
+  // read and by its identity, which the rename kept.
+  const auto inode = [](const std::string& path) {
+    struct stat st {};
+    EXPECT_EQ(0, ::stat(path.c_str(), &st));
+    return static_cast<uint64_t>(st.st_ino);
+  };
+  ASSERT_EQ(2u, analyzer_->marks.size());
+  const auto& [renamedAfter, renamed] = analyzer_->marks[0];
+  EXPECT_EQ(2u, renamedAfter);
+  EXPECT_EQ(dataFile("a-0001.sm3"), renamed.file);
+  EXPECT_EQ(inode(dataFile("a-0001.sm3")), renamed.inode);
+  EXPECT_EQ(sizeOf(dataFile("a-0001.sm3")), renamed.offset);
+  const auto& [liveAfter, restarted] = analyzer_->marks[1];
+  EXPECT_EQ(3u, liveAfter);
+  EXPECT_EQ(live, restarted.file);
+  EXPECT_EQ(inode(live), restarted.inode);
+  EXPECT_EQ(sizeOf(live), restarted.offset);
+
+  // A checkpoint's position is found again under the file's new name; a name now holding
+  // another file, with the old one gone, starts over; an unknown identity is taken as it is.
+  ReadPosition before{live, renamed.device, inode(live), 40};
+  std::filesystem::rename(live, dataFile("a-0002.sm3"));
+  append(live, page("/newer"));
+  const ReadPosition found = LocateReadPosition(before, data().c_str());
+  EXPECT_EQ(dataFile("a-0002.sm3"), found.file);
+  EXPECT_EQ(40, found.offset);
+  std::filesystem::remove(dataFile("a-0002.sm3"));
+  EXPECT_EQ(0, LocateReadPosition(before, data().c_str()).offset);
+  EXPECT_EQ(live, LocateReadPosition(before, data().c_str()).file);
+  before.device = before.inode = 0;
+  EXPECT_EQ(40, LocateReadPosition(before, data().c_str()).offset);
+}
+
+// A checkpoint's offset belongs to the file it names by identity: renamed twice over and
+// replaced by a file already longer than the offset, the old file's tail, the file renamed
+// after it and the new live file are each read once.
+TEST_F(DataFileMonitorTest, RenameCaughtByIdentityWhenTheNewFileIsLonger) {
+  const std::string live = dataFile("a.sm3");
+  append(live, page("/old/1") + page("/old/2"));
+  const long long offset = sizeOf(live);
+  append(live, page("/old/3"));
+  struct stat st {};
+  ASSERT_EQ(0, ::stat(live.c_str(), &st));
+  std::filesystem::rename(live, dataFile("a-0001.sm3"));
+  append(live, page("/between/1"));
+  std::filesystem::rename(live, dataFile("a-0002.sm3"));
+  std::string longer;
+  for (int i = 0; i < 5; ++i) {
+    longer += page("/new/" + std::to_string(i));
+  }
+  append(live, longer);
+  ASSERT_GT(sizeOf(live), offset);
+
+  CDPXDataFileMonitor monitor(live.c_str(), offset);
+  monitor.setReadIdentity(static_cast<uint64_t>(st.st_dev), static_cast<uint64_t>(st.st_ino));
+  monitor.setSink(analyzer_.get());
+  monitor.Start();
+  EXPECT_EQ((Strings{"/old/3", "/between/1", "/new/0", "/new/1", "/new/2", "/new/3", "/new/4"}),
+            urls(7));
+  monitor.Shutdown();
+  monitor.Join();
+  EXPECT_TRUE(urls(1, std::chrono::milliseconds(300)).empty());
 }
 
 // A truncated file with no renamed file beside it is read again from 0.

@@ -6,6 +6,7 @@
 
 #include "core/analyzer/intake/common.h"
 #include "core/analyzer/intake/dpx_transaction.h"
+#include "core/analyzer/intake/read_position.h"
 #include "core/analyzer/intake/sm3_framing.h"
 #include "core/analyzer/intake/sm3_parser.h"
 #include "core/analyzer/intake/transaction_identity.h"
@@ -166,19 +167,56 @@ bool CDPXDataFileMonitor::handleLegacyDPXRename() {
     CLOG::min("File [%s] is smaller [%lld] than expected [%lld], must of been renamed", getFile(),
               size, getReadToOffset());
     renamed = true;
+  } else if (identityChanged()) {
+    // Caught even when the new file has already grown past the offset, which the size cannot
+    // tell.
+    CLOG::min("File [%s] is another file than the one read so far, must of been renamed",
+              getFile());
+    renamed = true;
   }
   if (renamed) {
+    // The file read so far, found by its identity; else the newest renamed name.
     char newName[kFileInfoMaxPath + 1];
-    if (getNewLegacyFilename(getFile(), newName, sizeof(newName))) {
+    const std::string same =
+        FindFileByIdentity(CConfig::getDpxDataDirectory(), getReadDevice(), getReadInode());
+    bool found = !same.empty() && same.size() < sizeof(newName);
+    if (found) {
+      std::memcpy(newName, same.c_str(), same.size() + 1);
+    } else {
+      found = getNewLegacyFilename(getFile(), newName, sizeof(newName));
+    }
+    if (found) {
       CLOG::min(
           "Found new file name [%s] for previous file [%s]. Will process any remaining "
           "records.",
           newName, getFile());
       processStatically(newName, getLastProcessedOffset(), getExcludeOutlierMillis(), sink);
+      processLaterRenames(newName);
     }
     setLastProcessedOffset(0);
+    setReadIdentity(0, 0);
   }
   return renamed;
+}
+
+void CDPXDataFileMonitor::processLaterRenames(const char* renamed) {
+  std::string prefix = getFile();
+  const size_t dot = prefix.find('.');
+  if (dot != std::string::npos) {
+    prefix.resize(dot);
+  }
+  _FILE_INFO_LL* const list =
+      CCommon::sortFilesByName(CCommon::findFiles(CConfig::getDpxDataDirectory(), "*.sm3"));
+  for (const _FILE_INFO_LL* node = list; node != nullptr; node = node->next) {
+    const char* name = node->fileName;
+    if (std::strncmp(name, prefix.c_str(), prefix.size()) == 0 && std::strchr(name, '-') &&
+        std::strcmp(name, getFile()) != 0 && CCommon::newerFile(name, renamed)) {
+      CLOG::min("Found [%s], renamed after [%s] and never read. Will process its records.", name,
+                renamed);
+      processStatically(name, 0, getExcludeOutlierMillis(), sink);
+    }
+  }
+  CCommon::deleteFoundFiles(list);
 }
 
 void CDPXDataFileMonitor::Run() {
@@ -195,7 +233,11 @@ void CDPXDataFileMonitor::Run() {
     // Taken before looking for updates: a monitor turned static during this pass (a rollover)
     // may have missed what was appended just before, so it looks once more before stopping.
     const bool staticAtStart = isStatic.load();
-    bool updates = anyUpdates();
+    if (identityChanged() && !staticAtStart) {
+      handleLegacyDPXRename();
+    }
+    // A static monitor whose name now holds another file has nothing more of its own to read.
+    bool updates = anyUpdates() && !(staticAtStart && identityChanged());
     if (!updates) {
       const bool renamed = handleLegacyDPXRename();
       if (renamed) {
@@ -222,6 +264,10 @@ void CDPXDataFileMonitor::Run() {
         }
         advanceLastProcessedOffset(consumed);
         sink->intakeCounters().reading(getFile(), getLastProcessedOffset());
+        if (consumed > 0) {
+          sink->markPosition(
+              {getFile(), getReadDevice(), getReadInode(), getLastProcessedOffset()});
+        }
       } else {
         CLOG::trace(kFlowFlag, "Failed to read in any new file contents");
       }

@@ -7,8 +7,10 @@
 //
 // Two kinds:
 // - live (the file manager's monitor of the newest file): runs until Shutdown. When the file
-//   disappears or shrinks below what was read, the collector has renamed it; the monitor finds
-//   the renamed file, finishes it with a static monitor, and starts the live name again at 0.
+//   disappears, shrinks below what was read, or its name holds another file (device and
+//   inode), the collector has renamed it; the monitor finds the renamed file (by identity,
+//   else by name), finishes it and any file renamed after it with static monitors, and starts
+//   the live name again at 0.
 // - static (setStatic): finishes one file and stops by itself once the file has nothing more.
 //
 // Ownership: the owner creates, starts, stops (Shutdown + Join) and deletes the monitor. The
@@ -72,6 +74,9 @@ class CDPXDataFileMonitor : public CDataFileMonitor {
   // The rename handling of a live monitor; true when the file was found renamed (both offsets
   // are then 0).
   bool handleLegacyDPXRename();
+  // Reads the files the collector renamed after renamed (same prefix, newer by name): the
+  // live name moved on more than once before the monitor noticed, and it read none of them.
+  void processLaterRenames(const char* renamed);
 
   std::atomic<bool> isStatic{false};     // set by the owner, read by the thread
   std::atomic<bool> completed{false};    // set when Run returns

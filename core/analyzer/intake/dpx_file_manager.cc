@@ -55,6 +55,16 @@ bool CDPXFileManager::getPersistFileSpec(char* buffer, int size) {
   return true;
 }
 
+void CDPXFileManager::resumeAt(const char* file, long long offset, uint64_t device,
+                               uint64_t inode) {
+  CLOG::min("%s Resuming at the checkpoint's file [%s] offset[%lld]", "CDPXFileManager::resumeAt",
+            file, offset);
+  setLastProcessed(file, offset);
+  resumeFile = lastProcessedFile;
+  resumeDevice = device;
+  resumeInode = inode;
+}
+
 void CDPXFileManager::setLastProcessed(const char* file, long long offset) {
   lastProcessedFile.assign(file, strnlen(file, kFileInfoMaxPath));
   lastProcessedOffset = offset;
@@ -66,6 +76,10 @@ void CDPXFileManager::startANewMonitor() {
   currentMonitor =
       std::make_unique<CDPXDataFileMonitor>(lastProcessedFile.c_str(), lastProcessedOffset);
   currentMonitor->setExcludeOutlierMillis(getExcludeOutlierMillis());
+  if (!resumeFile.empty() && resumeFile == lastProcessedFile && lastProcessedOffset > 0) {
+    currentMonitor->setReadIdentity(resumeDevice, resumeInode);
+  }
+  resumeFile.clear();
   currentMonitor->setSink(getSink());
   CLOG::min("%s Start processing [%s]", "CDPXFileManager::startANewMonitor",
             lastProcessedFile.c_str());

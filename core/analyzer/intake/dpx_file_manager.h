@@ -15,6 +15,7 @@
 // offset while it runs; Shutdown (from another thread) sets the stop flag and joins the thread
 // before touching them.
 
+#include <cstdint>
 #include <memory>
 #include <string>
 
@@ -38,6 +39,12 @@ class CDPXFileManager : public CFileManager, public TransactionFeeder {
   void start() override { Start(); }
   void shutdownAndJoin() override { Shutdown(); }
 
+  // Resumes at file and offset instead of where "DPXLastFile" says: a checkpoint's position,
+  // which is newer after a crash. Owner, before Start.
+  // device and inode say which file the offset belongs to (0, 0: not known), so that a file
+  // renamed meanwhile is not read from it.
+  void resumeAt(const char* file, long long offset, uint64_t device, uint64_t inode);
+
   // The last processed file and offset: where the current monitor started, or, once stopped,
   // where reading stopped. Owner only while the thread is not running.
   const std::string& getLastProcessedFileName() const { return lastProcessedFile; }
@@ -58,6 +65,10 @@ class CDPXFileManager : public CFileManager, public TransactionFeeder {
   void setLastProcessed(const char* file, long long offset);
 
   std::string lastProcessedFile;  // at most 4096 characters; empty: none
+  // The identity resumeAt gave, for the first monitor started on lastProcessedFile.
+  std::string resumeFile;
+  uint64_t resumeDevice = 0;
+  uint64_t resumeInode = 0;
   long long lastProcessedOffset = 0;
   std::unique_ptr<CDPXDataFileMonitor> currentMonitor;
 };

@@ -27,18 +27,26 @@ class QueueOnlyAnalyzer : public CAnalyzer {
   explicit QueueOnlyAnalyzer(const std::string& dir) : CAnalyzer(dir.c_str()) {}
   ~QueueOnlyAnalyzer() override { take(); }
 
-  // Everything queued so far, in order; the test owns it.
+  // Every transaction queued so far, in order; the test owns it. Position marks go to marks,
+  // each with the number of transactions taken before it.
   std::vector<std::unique_ptr<CDPXTransaction>> take() {
     std::vector<std::unique_ptr<CDPXTransaction>> out;
     _TYPED_TRANSACTION item;
     while (!newQueue->IsEmpty() && newQueue->Get(item, 0) == 0) {
-      if (item.transaction != nullptr) {
+      if (item.transaction != nullptr && item.type == TRANSACTION_KIND_POSITION) {
+        std::unique_ptr<CPositionMark> mark(static_cast<CPositionMark*>(item.transaction));
+        marks.emplace_back(taken + out.size(), mark->position());
+      } else if (item.transaction != nullptr) {
         EXPECT_EQ(TRANSACTION_KIND_DPX, item.type);
         out.emplace_back(static_cast<CDPXTransaction*>(item.transaction));
       }
     }
+    taken += out.size();
     return out;
   }
+
+  std::vector<std::pair<size_t, ReadPosition>> marks;
+  size_t taken = 0;
 };
 
 class IntakeFixture : public ::testing::Test {

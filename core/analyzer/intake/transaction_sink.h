@@ -12,11 +12,14 @@
 #include <cstdint>
 
 #include "core/analyzer/intake/intake_counters.h"
+#include "core/analyzer/intake/read_position.h"
 #include "core/runtime/typed_transaction.h"
 
 // Kinds of queued transaction records.
 inline constexpr uint32_t TRANSACTION_KIND_DPX = 5;
 inline constexpr uint32_t TRANSACTION_KIND_SUBTX = 6;
+// A read position (CPositionMark) queued after the records it follows, not a transaction.
+inline constexpr uint32_t TRANSACTION_KIND_POSITION = 7;
 
 class TransactionSink {
  public:
@@ -33,6 +36,9 @@ class TransactionSink {
     }
     return all;
   }
+  // Where reading has got to: every record before position was handed over. Sinks that
+  // checkpoint queue it behind those records; the others ignore it.
+  virtual void markPosition(const ReadPosition& position) { (void)position; }
   // True once the sink is shutting down: readers stop taking records.
   virtual bool isShutdownRequested() const = 0;
   // What the readers count as they go (records read, unparsed, dropped; file and offset).

@@ -1,0 +1,146 @@
+// The analyzer's checkpoints: the current interval's rows saved together with the read
+// position that produced them, so that a start after a crash counts every record exactly once.
+//
+// Why this is enough: processing only ever adds to the current interval's trees (a record too
+// old for it is counted into it, never into a past interval's rows) and appends to the current
+// interval's instance files. So everything a run wrote after its last checkpoint is: the rows
+// of that checkpoint's interval saved at its rollover, files of later intervals, and instance
+// records past the checkpointed lengths. A recovery puts the checkpoint's rows back as that
+// interval's, removes the later files, cuts the instance files back and reads again from the
+// checkpoint's position.
+
+#include <sys/stat.h>
+
+#include <chrono>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "core/analyzer/analysis/checkpoint_state.h"
+#include "core/analyzer/analysis/interval_cache.h"
+#include "core/analyzer/dpx_analyzer.h"
+#include "core/analyzer/situation_controller.h"
+#include "core/config/cconfig.h"
+#include "core/history/checkpoint_file.h"
+#include "core/history/history_store.h"
+#include "core/history/instance_file.h"
+#include "core/runtime/clog.h"
+#include "framework/clock.h"
+
+namespace {
+
+constexpr const char* kInstanceStems[] = {"q7txins", "q7subtxins"};
+
+int64_t FileBytes(const std::string& path) {
+  struct stat st {};
+  return ::stat(path.c_str(), &st) == 0 ? static_cast<int64_t>(st.st_size) : 0;
+}
+
+}  // namespace
+
+void CDPXAnalyzer::notePosition(const ReadPosition& noted) {
+  position = noted;
+  if (!checkpointFile) {
+    return;
+  }
+  const long now = fw::Now();
+  if (checkpointDue || now - lastCheckpointAt >= CConfig::getCheckpointSeconds()) {
+    writeCheckpoint();
+  }
+}
+
+bool CDPXAnalyzer::writeCheckpoint() {
+  if (!checkpointFile) {
+    return false;
+  }
+  lastCheckpointAt = fw::Now();
+  CvelMutexLock lock(treeMutex);
+  // A past interval's rows swapped in are saved as that interval's; the checkpoint holds the
+  // current interval's.
+  cache->flush();
+  flushInstanceFile();
+  flushSubInstanceFile();
+  CheckpointState state;
+  state.sequence = checkpointSequence + 1;
+  state.interval = getCurrentOverTimeInterval();
+  state.written = lastCheckpointAt;
+  state.position = position;
+  state.instanceLevel = lastInstanceLevel;
+  state.oldTransactions = oldTransactions;
+  state.transactionsReceived = transactionsReceived;
+  for (const char* stem : kInstanceStems) {
+    state.instanceFiles.push_back(
+        {stem, state.interval, FileBytes(history->pathOf(state.interval, stem))});
+  }
+  state.patterns = situations().getPatternCounters();
+  if (!checkpointFile->save(state.encode(), cache->currentIntervalTrees().sections())) {
+    return false;  // traced; tried again when the next one falls due
+  }
+  checkpointSequence = state.sequence;
+  checkpointDue = false;
+  CLOG::med("Checkpoint %llu of interval[%ld] at [%s] offset[%lld]",
+            static_cast<unsigned long long>(state.sequence), static_cast<long>(state.interval),
+            position.file.c_str(), position.offset);
+  return true;
+}
+
+bool CDPXAnalyzer::recoverFromCheckpoint() {
+  if (!checkpointFile) {
+    return false;
+  }
+  const auto began = std::chrono::steady_clock::now();
+  history::CheckpointImage image;
+  if (checkpointFile->load(&image) != history::CheckpointFile::Load::kLoaded) {
+    return false;  // none, or set aside and traced
+  }
+  CheckpointState state;
+  std::string why;
+  auto rows = std::make_unique<COverTimeTrees>();
+  if (!CheckpointState::decode(image.description, &state, &why)) {
+    checkpointFile->setAside(why);
+    return false;
+  }
+  for (const history::LoadedSection& section : image.sections) {
+    if (!rows->loadSection(section)) {
+      checkpointFile->setAside("rows of an unknown table or record size: " + section.stem);
+      return false;
+    }
+  }
+  // Everything is read: only now are the files put back.
+  const long interval = static_cast<long>(state.interval);
+  const int removed = history->removeIntervalsAfter(interval);
+  for (const InstanceFileLength& file : state.instanceFiles) {
+    history->truncateInterval(file.interval, file.stem, static_cast<off_t>(file.bytes));
+  }
+  const int counters = situations().restorePatternCounters(state.patterns);
+  lastInstanceLevel = static_cast<short>(state.instanceLevel);
+  oldTransactions = state.oldTransactions;
+  transactionsReceived = state.transactionsReceived;
+  checkpointSequence = state.sequence;
+  resumeAt = state.position;
+  position = state.position;
+  CLOG::min(
+      "Resuming from checkpoint %llu of interval[%ld] (%ld rows, %d pattern counters, %d later "
+      "history files removed) at [%s] offset[%lld], restored in %lld ms",
+      static_cast<unsigned long long>(state.sequence), interval, rows->totalRows(), counters,
+      removed, state.position.file.c_str(), state.position.offset,
+      static_cast<long long>(std::chrono::duration_cast<std::chrono::milliseconds>(
+                                 std::chrono::steady_clock::now() - began)
+                                 .count()));
+  if (interval == getCurrentOverTimeInterval()) {
+    cache->replaceCurrent(std::move(rows));
+    return true;
+  }
+  // The interval ended while the agent was down: save it as its rollover would have, and
+  // start the current one afresh.
+  rows->save(*history, interval);
+  auto fresh = std::make_unique<COverTimeTrees>();
+  if (CConfig::getReportZeroRecords()) {
+    fresh->seedZeroRows(*rows, getCurrentOverTimeInterval());
+  }
+  cache->replaceCurrent(std::move(fresh));
+  oldTransactions = 0;
+  transactionsReceived = 0;
+  checkpointDue = true;
+  return true;
+}
