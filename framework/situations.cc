@@ -301,11 +301,10 @@ int RestoreSituations() {
     }
   }
   if (!problem.empty()) {
-    const std::string aside = registry.file + ".bad";
-    std::rename(registry.file.c_str(), aside.c_str());
+    const std::string aside = SetFileAside(registry.file);
     TracePrintfAlways(kUnit, kTraceError, __func__,
                       "%s %s; kept aside as %s, no situations restored", registry.file.c_str(),
-                      problem.c_str(), aside.c_str());
+                      problem.c_str(), aside.empty() ? "(could not be moved)" : aside.c_str());
     return 0;
   }
   for (Started& s : restored) {

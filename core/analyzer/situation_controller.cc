@@ -15,6 +15,7 @@
 #include "core/analyzer/pattern_overlap.h"
 #include "core/runtime/clog.h"
 #include "core/runtime/misc.h"
+#include "core/runtime/set_aside.h"
 #include "framework/atomic_file.h"
 #include "framework/file_io.h"
 #include "framework/status.h"
@@ -599,6 +600,8 @@ bool CSituationController::reload(PatternFile& file, std::vector<Entry<Pattern>>
   }
   const long count = RecordCount(image, K::kRecordSize, file.path.c_str());
   if (count < 0) {
+    // The situations list registers its patterns again, which writes a new file.
+    SetAsideTraced("Pattern file", file.path, "format version or size");
     return false;
   }
   std::vector<Entry<Pattern>> loaded;

@@ -11,6 +11,7 @@
 #include <cstring>
 #include <ctime>
 #include <filesystem>
+#include <fstream>
 #include <memory>
 #include <string>
 #include <thread>
@@ -18,6 +19,7 @@
 #include <vector>
 
 #include "core/runtime/misc.h"
+#include "framework/trace_capture.h"
 
 namespace {
 
@@ -113,8 +115,8 @@ TEST_F(SituationControllerTest, SamplingTakesTheShareAskedFor) {
 // every position and characters ICU folds onto ASCII (the Kelvin sign, long s), against random
 // names, including ones that are not ASCII; and again after removals and a reload.
 TEST_F(SituationControllerTest, IndexedMatchingAgreesWithTheOrderedScan) {
-  const std::vector<std::string> patternParts = {"a", "A", "b", "ab", "/", ".", "*", "*",
-                                                 "\xe2\x84\xaa", "\xc5\xbf", "k", "s"};
+  const std::vector<std::string> patternParts = {
+      "a", "A", "b", "ab", "/", ".", "*", "*", "\xe2\x84\xaa", "\xc5\xbf", "k", "s"};
   const std::vector<std::string> textParts = {"a", "B", "b", "/", ".", "k", "K", "s", "\xc3\xa9"};
   std::srand(19);
   const auto random = [](const std::vector<std::string>& parts, int most) {
@@ -153,14 +155,16 @@ TEST_F(SituationControllerTest, IndexedMatchingAgreesWithTheOrderedScan) {
       const std::string a = random(textParts, 4);
       const std::string b = random(textParts, 6);
       for (const bool all : {false, true}) {
-        ASSERT_EQ(expect(txs, a.c_str(), b.c_str(), all,
-                         [](const TransactionPattern& p) { return p.applicationPattern; },
-                         [](const TransactionPattern& p) { return p.transactionPattern; }),
+        ASSERT_EQ(expect(
+                      txs, a.c_str(), b.c_str(), all,
+                      [](const TransactionPattern& p) { return p.applicationPattern; },
+                      [](const TransactionPattern& p) { return p.transactionPattern; }),
                   Match(a.c_str(), b.c_str(), all, false))
             << "[" << a << "] [" << b << "] all=" << all;
-        ASSERT_EQ(expect(clients, a.c_str(), b.c_str(), all,
-                         [](const ClientPattern& p) { return p.hostNamePattern; },
-                         [](const ClientPattern& p) { return p.ipAddressPattern; }),
+        ASSERT_EQ(expect(
+                      clients, a.c_str(), b.c_str(), all,
+                      [](const ClientPattern& p) { return p.hostNamePattern; },
+                      [](const ClientPattern& p) { return p.ipAddressPattern; }),
                   MatchClient(a.c_str(), b.c_str(), all))
             << "[" << a << "] [" << b << "] all=" << all;
       }
@@ -297,7 +301,8 @@ TEST_F(SituationControllerTest, NewerFileFromAnotherWriterIsPickedUp) {
   EXPECT_EQ(0, controller_->loadPatternsIfNewer());
 }
 
-// A damaged file leaves the patterns alone; a file without records empties them.
+// A damaged file leaves the patterns alone and is set aside, named in the trace; a file without
+// records empties them.
 TEST_F(SituationControllerTest, DamagedFileKeepsPatternsEmptyFileClearsThem) {
   controller_->addTransactionPattern(Tx("s", "*", "*"));
   const std::string path = dir_ + "/tpatterns.dat";
@@ -307,8 +312,14 @@ TEST_F(SituationControllerTest, DamagedFileKeepsPatternsEmptyFileClearsThem) {
 
   ASSERT_EQ(0, CMisc::truncateFile(path.c_str(), static_cast<unsigned long>(size - 10)));
   Touch("tpatterns.dat");
-  EXPECT_EQ(0, controller_->loadPatternsIfNewer());
+  {
+    fw::TraceCapture capture("*=ALL");
+    EXPECT_EQ(0, controller_->loadPatternsIfNewer());
+    EXPECT_TRUE(capture.contains("Pattern file " + path + " does not load"));
+  }
   EXPECT_EQ(1, controller_->getTransactionPatternCount());
+  EXPECT_FALSE(std::filesystem::exists(path));
+  EXPECT_TRUE(std::filesystem::exists(path + ".bad"));
 
   FILE* f = fopen(path.c_str(), "wb");
   const uint32_t words[2] = {2, 0};  // a future format version
@@ -318,7 +329,8 @@ TEST_F(SituationControllerTest, DamagedFileKeepsPatternsEmptyFileClearsThem) {
   EXPECT_EQ(0, controller_->loadPatternsIfNewer());
   EXPECT_EQ(1, controller_->getTransactionPatternCount());
 
-  ASSERT_EQ(0, CMisc::truncateFile(path.c_str(), 0));
+  EXPECT_FALSE(std::filesystem::exists(path));
+  std::ofstream(path, std::ios::trunc);
   Touch("tpatterns.dat");
   EXPECT_EQ(1, controller_->loadPatternsIfNewer());
   EXPECT_EQ(0, controller_->getTransactionPatternCount());

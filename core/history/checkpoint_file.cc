@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "core/runtime/clog.h"
+#include "core/runtime/set_aside.h"
 #include "framework/atomic_file.h"
 #include "framework/file_io.h"
 #include "framework/status.h"
@@ -102,7 +103,8 @@ bool CheckpointFile::save(std::string_view description,
     return sink(Bytes(hash.value()));
   };
   std::string error;
-  if (fw::ReplaceFileInPieces(path_, produce, {0600, ""}, nullptr, &error) != fw::kOk) {
+  // A fixed temporary name: what a crash left behind is overwritten by the next save.
+  if (fw::ReplaceFileInPieces(path_, produce, {0600, path_ + ".tmp"}, nullptr, &error) != fw::kOk) {
     CLOG::error("%s checkpoint not saved, the previous one stays: %s", "CheckpointFile::save",
                 error.c_str());
     return false;
@@ -192,14 +194,7 @@ CheckpointFile::Load CheckpointFile::load(CheckpointImage* image) const {
 }
 
 void CheckpointFile::setAside(const std::string& why) const {
-  const std::string aside = fw::SetFileAside(path_);
-  if (aside.empty()) {
-    CLOG::error("Checkpoint %s does not load (%s) and could not be set aside: %s", path_.c_str(),
-                why.c_str(), std::strerror(errno));
-  } else {
-    CLOG::error("Checkpoint %s does not load (%s); set aside as %s, starting without it",
-                path_.c_str(), why.c_str(), aside.c_str());
-  }
+  SetAsideTraced("Checkpoint", path_, why);
 }
 
 }  // namespace history

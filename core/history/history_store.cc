@@ -16,6 +16,7 @@
 
 #include "core/history/history_file_name.h"
 #include "core/runtime/clog.h"
+#include "core/runtime/set_aside.h"
 #include "framework/atomic_file.h"
 #include "framework/file_io.h"
 #include "framework/status.h"
@@ -210,6 +211,14 @@ std::vector<std::byte> HistoryStore::loadInterval(int64_t interval, std::string_
   }
   const std::string path = pathOf(interval, stem);
   const RecordFile file = OpenRecords(path, record_size, kWhere);
+  if (file.fd.valid() && static_cast<size_t>(fw::FileSize(file.fd.get())) % record_size != 0) {
+    // Interval files are only ever replaced whole: this one is damaged or not ours, and its
+    // records cannot be trusted to be rows.
+    if (SetAsideTraced("History file", path, "not a whole number of records")) {
+      Advance();
+    }
+    return records;
+  }
   records.resize(file.records * record_size);
   const size_t got = ReadRecords(file, record_size, file.records, records.data(), path, kWhere);
   records.resize(got * record_size);

@@ -68,7 +68,8 @@ class HistoryStore {
                   int64_t interval_seconds, size_t record_size, size_t max_rows, void* out) const;
 
   // The whole records of one interval, back to back; empty when the file is missing or
-  // unreadable.
+  // unreadable. A file that is not a whole number of records (damaged: interval files are
+  // replaced whole) is set aside as "<name>.bad", traced, and reads as empty.
   std::vector<std::byte> loadInterval(int64_t interval, std::string_view stem,
                                       size_t record_size) const;
 

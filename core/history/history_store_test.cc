@@ -100,18 +100,18 @@ TEST_F(HistoryStoreTest, SavingInPiecesWritesTheSameFile) {
   ASSERT_TRUE(store_.saveInterval(kT, "q7txot", records.data(), sizeof(Record), count));
   const std::vector<std::byte> whole = store_.loadInterval(kT, "q7txot", sizeof(Record));
   size_t next = 0;
-  ASSERT_TRUE(store_.saveIntervalInPieces(
-      kT + kStep, "q7txot", sizeof(Record), count, [&](size_t first, size_t n, void* out) {
-        EXPECT_EQ(next, first);
-        EXPECT_LE(n, HistoryStore::kPieceRecords);
-        next = first + n;
-        auto* rows = static_cast<Record*>(out);
-        for (size_t i = 0; i < n; ++i) {
-          EXPECT_EQ(0, rows[i].pad);
-          rows[i].interval = kT;
-          rows[i].id = static_cast<int32_t>(first + i);
-        }
-      }));
+  ASSERT_TRUE(store_.saveIntervalInPieces(kT + kStep, "q7txot", sizeof(Record), count,
+                                          [&](size_t first, size_t n, void* out) {
+                                            EXPECT_EQ(next, first);
+                                            EXPECT_LE(n, HistoryStore::kPieceRecords);
+                                            next = first + n;
+                                            auto* rows = static_cast<Record*>(out);
+                                            for (size_t i = 0; i < n; ++i) {
+                                              EXPECT_EQ(0, rows[i].pad);
+                                              rows[i].interval = kT;
+                                              rows[i].id = static_cast<int32_t>(first + i);
+                                            }
+                                          }));
   EXPECT_EQ(count, next);
   EXPECT_TRUE(whole == store_.loadInterval(kT + kStep, "q7txot", sizeof(Record)));
 }
@@ -155,17 +155,24 @@ TEST_F(HistoryStoreTest, LeftoverTemporaryFileIsNotData) {
   EXPECT_EQ((std::vector<int>{1, 2}), ids(load(kT, 2, 10)));
 }
 
-// A file cut inside a record yields its whole records only, and says so.
+// A file cut inside a record yields its whole records only to the row readers (an instance
+// file cut by a crash), and says so. Loaded as an interval's rows it is set aside: interval
+// files are replaced whole, so a cut one is damaged.
 TEST_F(HistoryStoreTest, RecordCutMidwayIsIgnored) {
   save(kT, 1, 3);
   save(kT - kStep, 10, 2);
-  std::filesystem::resize_file(store_.pathOf(kT, "q7txot"), 2 * sizeof(Record) + 5);
+  const std::string path = store_.pathOf(kT, "q7txot");
+  std::filesystem::resize_file(path, 2 * sizeof(Record) + 5);
   fw::TraceCapture capture;
 
   EXPECT_EQ(4u, store_.countRows("q7txot", kT, 2, kStep, sizeof(Record)));
   EXPECT_EQ((std::vector<int>{1, 2, 10, 11}), ids(load(kT, 2, 10)));
-  EXPECT_EQ(2 * sizeof(Record), store_.loadInterval(kT, "q7txot", sizeof(Record)).size());
   EXPECT_TRUE(capture.contains("not a whole number of 16-byte records"));
+
+  EXPECT_TRUE(store_.loadInterval(kT, "q7txot", sizeof(Record)).empty());
+  EXPECT_TRUE(capture.contains("History file " + path + " does not load"));
+  EXPECT_TRUE(std::filesystem::exists(path + ".bad"));
+  EXPECT_EQ(2u, store_.countRows("q7txot", kT, 2, kStep, sizeof(Record)));
 }
 
 // A save that cannot write keeps the previous file and reports the path.
