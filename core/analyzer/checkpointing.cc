@@ -43,8 +43,9 @@ void CDPXAnalyzer::notePosition(const ReadPosition& noted) {
   if (!checkpointFile) {
     return;
   }
+  // After a rollover at once, but a failing one is tried at most once a second.
   const long now = fw::Now();
-  if (checkpointDue || now - lastCheckpointAt >= CConfig::getCheckpointSeconds()) {
+  if (now - lastCheckpointAt >= (checkpointDue ? 1 : CConfig::getCheckpointSeconds())) {
     writeCheckpoint();
   }
 }
@@ -58,8 +59,16 @@ bool CDPXAnalyzer::writeCheckpoint() {
   // A past interval's rows swapped in are saved as that interval's; the checkpoint holds the
   // current interval's.
   cache->flush();
-  flushInstanceFile();
-  flushSubInstanceFile();
+  // A checkpoint says what the files hold: while an ended interval or instance records are
+  // still unwritten (a full disk), the previous checkpoint stays the one to recover from.
+  if (!saveUnsaved() || !instanceFile->flush() || !subInstanceFile->flush()) {
+    if (!checkpointPutOff) {
+      CLOG::min("Checkpoint put off: history or instance records are not written yet");
+    }
+    checkpointPutOff = true;
+    return false;
+  }
+  checkpointPutOff = false;
   CheckpointState state;
   state.sequence = checkpointSequence + 1;
   state.interval = getCurrentOverTimeInterval();
@@ -133,10 +142,12 @@ bool CDPXAnalyzer::recoverFromCheckpoint() {
   }
   // The interval ended while the agent was down: save it as its rollover would have, and
   // start the current one afresh.
-  rows->save(*history, interval);
   auto fresh = std::make_unique<COverTimeTrees>();
   if (CConfig::getReportZeroRecords()) {
     fresh->seedZeroRows(*rows, getCurrentOverTimeInterval());
+  }
+  if (!rows->save(*history, interval)) {
+    unsaved.emplace_back(interval, std::move(rows));
   }
   cache->replaceCurrent(std::move(fresh));
   oldTransactions = 0;

@@ -104,7 +104,8 @@ void CDPXAnalyzer::startRun() {
   CvelMutexLock lock(treeMutex);
   // The current interval's rows saved by an earlier run stay the current trees, so a restart
   // within an interval keeps its data; a checkpoint, when there is one, is newer.
-  if (!recoverFromCheckpoint()) {
+  recovered = recoverFromCheckpoint();
+  if (!recovered) {
     cache->loadCurrent(getCurrentOverTimeInterval());
   }
   referenceInterval = getCurrentOverTimeInterval();
@@ -126,7 +127,7 @@ void CDPXAnalyzer::rollover() {
   oldTransactions = 0;
   transactionsReceived = 0;
   const long ended = getCurrentOverTimeInterval();
-  saveIntervalData(ended);
+  const bool saved = saveIntervalData(ended);
   // The saved interval joins every summary's history: the folds kept are stale, so free them.
   summaryFolds->clear();
   updateCurrentOverTimeInterval();
@@ -134,7 +135,13 @@ void CDPXAnalyzer::rollover() {
   if (CConfig::getReportZeroRecords()) {
     fresh->seedZeroRows(cache->trees(), getCurrentOverTimeInterval());
   }
-  cache->replaceCurrent(std::move(fresh));
+  std::unique_ptr<COverTimeTrees> endedRows = cache->replaceCurrent(std::move(fresh));
+  if (!saved) {
+    // A full disk, say: the rows are kept and saved again before the next checkpoint.
+    CLOG::error("Interval[%ld] could not be saved; its %ld rows are kept to save again", ended,
+                endedRows->totalRows());
+    unsaved.emplace_back(ended, std::move(endedRows));
+  }
   referenceInterval = getCurrentOverTimeInterval();
   // The ended interval's rows are saved with the records after the last checkpoint in them;
   // the next checkpoint, at the next position noted, makes them final.
@@ -150,6 +157,7 @@ void CDPXAnalyzer::finishRun() {
     CvelMutexLock lock(treeMutex);
     cache->flush();
     cache->discard();
+    saveUnsaved();
     saveAllData(getCurrentOverTimeInterval());
     flushInstanceFile();
     flushSubInstanceFile();
@@ -167,7 +175,9 @@ void CDPXAnalyzer::Run() {
     auto manager = std::make_unique<CDPXFileManager>();
     manager->setDirToWatch(paths.dataDirectory.c_str());
     manager->setSink(this);
-    if (!resumeAt.file.empty()) {
+    if (recovered) {
+      // Even with no file named: the checkpoint was taken before anything was read, and
+      // "DPXLastFile" may be newer than it.
       position = LocateReadPosition(resumeAt, paths.dataDirectory.c_str());
       manager->resumeAt(position.file.c_str(), position.offset, position.device, position.inode);
     } else {
@@ -278,10 +288,24 @@ void CDPXAnalyzer::flushSubInstanceFile() {
   subInstanceFile->flush();
 }
 
-void CDPXAnalyzer::saveIntervalData(long interval) {
-  cache->trees().save(*history, interval);
+bool CDPXAnalyzer::saveIntervalData(long interval) {
+  const bool saved = cache->trees().save(*history, interval);
   flushInstanceFile();
   flushSubInstanceFile();
+  return saved;
+}
+
+bool CDPXAnalyzer::saveUnsaved() {
+  while (!unsaved.empty()) {
+    auto& [interval, rows] = unsaved.front();
+    if (!rows->save(*history, interval)) {
+      return false;  // traced by the store
+    }
+    CLOG::min("Interval[%ld] saved after all (%ld rows)", interval, rows->totalRows());
+    unsaved.erase(unsaved.begin());
+    summaryFolds->clear();
+  }
+  return true;
 }
 
 void CDPXAnalyzer::saveAllData(long interval) {

@@ -15,6 +15,8 @@
 #include <cstddef>
 #include <functional>
 #include <memory>
+#include <utility>
+#include <vector>
 
 #include "core/analyzer/analysis/interval_cache.h"
 #include "core/analyzer/analysis/over_time_trees.h"
@@ -160,7 +162,10 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // Loads the checkpoint and puts everything back as it stood then; false when there is none
   // (or it was set aside), leaving everything untouched.
   bool recoverFromCheckpoint() REQUIRES(treeMutex);
-  void saveIntervalData(long interval) REQUIRES(treeMutex);
+  // False when the interval's rows could not all be saved.
+  bool saveIntervalData(long interval) REQUIRES(treeMutex);
+  // Saves the intervals whose save failed, oldest first; false while any remains unsaved.
+  bool saveUnsaved() REQUIRES(treeMutex);
   void saveAllData(long interval) REQUIRES(treeMutex);
   void cleanupOldFiles();
 
@@ -175,6 +180,8 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   std::unique_ptr<IntervalCache> cache PT_GUARDED_BY(treeMutex);  // the trees, and the cache
   std::unique_ptr<history::InstanceFile> instanceFile PT_GUARDED_BY(treeMutex);
   std::unique_ptr<history::InstanceFile> subInstanceFile PT_GUARDED_BY(treeMutex);
+  // Ended intervals whose rows could not be saved (a full disk), oldest first.
+  std::vector<std::pair<long, std::unique_ptr<COverTimeTrees>>> unsaved GUARDED_BY(treeMutex);
   // Each summary's history fold, kept between queries; locks itself.
   const std::unique_ptr<SummaryFolds> summaryFolds;
   // The interval transactions are judged against. Written by the analyzer thread under the
@@ -186,9 +193,11 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
 
   // Checkpoints; all analyzer thread. Null file: checkpoints are off.
   std::unique_ptr<history::CheckpointFile> checkpointFile;
-  ReadPosition position;  // every record before it is in the trees
-  ReadPosition resumeAt;  // the recovered checkpoint's position
+  ReadPosition position;   // every record before it is in the trees
+  ReadPosition resumeAt;   // the recovered checkpoint's position
+  bool recovered = false;  // startRun loaded a checkpoint
   uint64_t checkpointSequence = 0;
-  long lastCheckpointAt = 0;   // when the last one was tried, seconds since 1970
-  bool checkpointDue = false;  // a rollover happened since the last one
+  long lastCheckpointAt = 0;      // when the last one was tried, seconds since 1970
+  bool checkpointDue = false;     // a rollover happened since the last one
+  bool checkpointPutOff = false;  // the last one waited for unwritten records (traced once)
 };

@@ -10,6 +10,7 @@
 
 #include "core/history/history_file_name.h"
 #include "core/runtime/clog.h"
+#include "framework/file_io.h"
 
 namespace history {
 
@@ -23,7 +24,6 @@ constexpr size_t kBufferBytes = 64 * 1024;
 InstanceFile::InstanceFile(std::string directory, std::string stem, size_t record_size)
     : directory_(std::move(directory)), stem_(std::move(stem)), record_size_(record_size) {
   assert(record_size_ > 0 && "instance records must have a size");
-  pending_.reserve(kBufferBytes + record_size_);
 }
 
 InstanceFile::~InstanceFile() {
@@ -31,80 +31,91 @@ InstanceFile::~InstanceFile() {
 }
 
 bool InstanceFile::append(int64_t interval, const void* record) {
-  bool ok = true;
-  if (interval != interval_) {
-    ok = switchTo(interval);
-  }
-  if (!fd_.valid()) {
-    // The failed open was traced once; the records of this interval are only counted.
+  static const char* const kWhere = "InstanceFile::append";
+  if (interval < 0) {
+    CLOG::error("%s negative interval start %lld for %s", kWhere, static_cast<long long>(interval),
+                stem_.c_str());
     ++dropped_;
     return false;
   }
-  const std::byte* bytes = static_cast<const std::byte*>(record);
-  pending_.insert(pending_.end(), bytes, bytes + record_size_);
-  if (pending_.size() >= kBufferBytes) {
-    ok = flush() && ok;
+  if (held_bytes_ + record_size_ > kMaxHeldBytes) {
+    if (dropped_++ == 0 || dropped_ % 10000 == 0) {
+      CLOG::error("%s %zu bytes of %s records are held back unwritten; %llu records dropped",
+                  kWhere, held_bytes_, stem_.c_str(), static_cast<unsigned long long>(dropped_));
+    }
+    return false;
   }
-  return ok;
+  interval_ = interval;
+  if (pending_.empty() || pending_.back().interval != interval) {
+    pending_.push_back({interval, {}});
+    pending_.back().bytes.reserve(kBufferBytes + record_size_);
+  }
+  const std::byte* bytes = static_cast<const std::byte*>(record);
+  pending_.back().bytes.insert(pending_.back().bytes.end(), bytes, bytes + record_size_);
+  held_bytes_ += record_size_;
+  // A failing disk is tried again at the next flush, not at every record.
+  if (pending_.back().bytes.size() >= kBufferBytes && !failing_) {
+    return flush();
+  }
+  return true;
 }
 
 bool InstanceFile::flush() {
   static const char* const kWhere = "InstanceFile::flush";
-  if (pending_.empty()) {
-    return true;
+  size_t written = 0;
+  size_t recordsWritten = 0;
+  for (; written < pending_.size(); ++written) {
+    std::string path;
+    if (!write(pending_[written], &path)) {
+      if (!failing_) {
+        CLOG::error("%s cannot write %s: %s; holding %zu records to write later", kWhere,
+                    path.c_str(), std::strerror(errno), held_bytes_ / record_size_);
+      }
+      failing_ = true;
+      break;
+    }
+    held_bytes_ -= pending_[written].bytes.size();
+    recordsWritten += pending_[written].bytes.size() / record_size_;
   }
-  const size_t records = pending_.size() / record_size_;
-  const bool written = fd_.valid() && fw::WriteAll(fd_.get(), pending_.data(), pending_.size());
-  if (written) {
-    committed_ += static_cast<off_t>(pending_.size());
-    pending_.clear();
-    return true;
+  pending_.erase(pending_.begin(), pending_.begin() + static_cast<std::ptrdiff_t>(written));
+  if (failing_ && pending_.empty()) {
+    failing_ = false;
+    CLOG::min("%s %s records are written again (%zu caught up)", kWhere, stem_.c_str(),
+              recordsWritten);
   }
-  const int saved = errno;
-  const std::string path = directory_ + "/" + IntervalFileName(interval_, stem_);
-  // Whatever part of the buffer reached the file would misalign every later record.
-  if (fd_.valid() && ::ftruncate(fd_.get(), committed_) != 0) {
-    CLOG::error("%s cannot cut %s back to %lld bytes: %s", kWhere, path.c_str(),
-                static_cast<long long>(committed_), std::strerror(errno));
-  }
-  CLOG::error("%s dropped %zu records for %s: %s", kWhere, records, path.c_str(),
-              std::strerror(saved));
-  dropped_ += records;
-  pending_.clear();
-  return false;
+  return pending_.empty();
 }
 
-bool InstanceFile::switchTo(int64_t interval) {
-  static const char* const kWhere = "InstanceFile::switchTo";
-  const bool flushed = flush();
-  fd_.reset();
-  committed_ = 0;
-  interval_ = interval;
-  if (interval < 0) {
-    CLOG::error("%s negative interval start %lld for %s", kWhere, static_cast<long long>(interval),
-                stem_.c_str());
-    return false;
+bool InstanceFile::write(const Pending& pending, std::string* path) const {
+  static const char* const kWhere = "InstanceFile::write";
+  *path = directory_ + "/" + IntervalFileName(pending.interval, stem_);
+  if (pending.bytes.empty()) {
+    return true;
   }
-  const std::string path = directory_ + "/" + IntervalFileName(interval, stem_);
-  fw::UniqueFd fd = fw::OpenCreatingParent(path, O_WRONLY | O_CREAT | O_APPEND);
+  fw::UniqueFd fd = fw::OpenCreatingParent(*path, O_WRONLY | O_CREAT | O_APPEND);
   const off_t size = fd.valid() ? fw::FileSize(fd.get()) : -1;
   if (size < 0) {
-    CLOG::error("%s cannot open %s: %s", kWhere, path.c_str(), std::strerror(errno));
     return false;
   }
   const off_t whole = size - size % static_cast<off_t>(record_size_);
   if (whole != size) {
     if (::ftruncate(fd.get(), whole) != 0) {
-      CLOG::error("%s cannot cut the partial record off %s: %s", kWhere, path.c_str(),
-                  std::strerror(errno));
       return false;
     }
     CLOG::error("%s cut a partial record of %lld bytes off %s", kWhere,
-                static_cast<long long>(size - whole), path.c_str());
+                static_cast<long long>(size - whole), path->c_str());
   }
-  fd_ = std::move(fd);
-  committed_ = whole;
-  return flushed;
+  if (fw::WriteAll(fd.get(), pending.bytes.data(), pending.bytes.size())) {
+    return true;
+  }
+  // Whatever part of the records reached the file would misalign every later record.
+  const int saved = errno;
+  if (::ftruncate(fd.get(), whole) != 0) {
+    CLOG::error("%s cannot cut %s back to %lld bytes: %s", kWhere, path->c_str(),
+                static_cast<long long>(whole), std::strerror(errno));
+  }
+  errno = saved;
+  return false;
 }
 
 }  // namespace history

@@ -110,19 +110,30 @@ TEST_F(InstanceFileTest, CutRecordIsRemovedBeforeAppending) {
   EXPECT_TRUE(capture.contains("cut a partial record of 10 bytes"));
 }
 
-// An interval whose file cannot be opened drops its records, counted; the next one works.
-TEST_F(InstanceFileTest, UnopenableIntervalDropsItsRecords) {
-  std::filesystem::create_directories(store_.pathOf(kT, "q7txins"));
+// Records whose file cannot be written (here a directory stands in its place; a full disk is
+// the same) are held, in order, traced once, and written once the file can be: none is lost.
+TEST_F(InstanceFileTest, UnwritableFileHoldsItsRecordsUntilItCanBeWritten) {
+  const std::string blocked = store_.pathOf(kT, "q7txins");
+  std::filesystem::create_directories(blocked);
   fw::TraceCapture capture;
-  const Instance instance = make(1);
-  EXPECT_FALSE(file_.append(kT, &instance));
-  EXPECT_FALSE(file_.append(kT, &instance));
-  EXPECT_EQ(2u, file_.droppedRecords());
-  EXPECT_EQ(1, capture.count("cannot open"));
+  for (int64_t id = 1; id <= 2; ++id) {
+    const Instance instance = make(id);
+    EXPECT_TRUE(file_.append(kT, &instance));
+    EXPECT_FALSE(file_.flush());
+  }
+  const Instance next = make(3);
+  EXPECT_TRUE(file_.append(kT + kStep, &next));
+  EXPECT_FALSE(file_.flush());  // the older interval first: order is kept
+  EXPECT_EQ(3u, file_.heldRecords());
+  EXPECT_EQ(0u, file_.droppedRecords());
+  EXPECT_EQ(1, capture.count("holding"));
+  EXPECT_TRUE(readIds(kT + kStep, 2).empty());
 
-  ASSERT_TRUE(file_.append(kT + kStep, &instance));
-  ASSERT_TRUE(file_.flush());
-  EXPECT_EQ((std::vector<int64_t>{1}), readIds(kT + kStep, 1));
+  std::filesystem::remove(blocked);
+  EXPECT_TRUE(file_.flush());
+  EXPECT_EQ(0u, file_.heldRecords());
+  EXPECT_EQ((std::vector<int64_t>{3, 1, 2}), readIds(kT + kStep, 2));  // newest interval first
+  EXPECT_TRUE(capture.contains("records are written again"));
 }
 
 }  // namespace

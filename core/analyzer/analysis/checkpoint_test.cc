@@ -10,6 +10,8 @@
 #include <string>
 
 #include "core/analyzer/analysis/analyzer_fixture.h"
+#include "core/analyzer/analysis/checkpoint_state.h"
+#include "core/history/checkpoint_file.h"
 #include "core/history/history_store.h"
 #include "core/layouts/table_layouts.h"
 #include "framework/trace_capture.h"
@@ -27,6 +29,12 @@ class CheckpointTest : public q7test::AnalyzerFixture {
     AddPattern("shop", "Shop", "shop.example", "Tx", "*", 50, 1);
   }
   std::string checkpoint() { return dir_.file("q7checkpoint.dat"); }
+  static long long PositionOf(const history::CheckpointImage& image) {
+    CheckpointState state;
+    std::string why;
+    return CheckpointState::decode(image.description, &state, &why) ? state.position.offset : -1;
+  }
+  history::CheckpointImage image_;
 
   // Pages i..j-1 of the collector's file, each noted as read up to its end (100 bytes each)
   // unless the crash comes before the notes.
@@ -167,6 +175,32 @@ TEST_F(CheckpointTest, BadCheckpointsAreSetAside) {
     EXPECT_EQ(2, Rows()[App("Shop")]);  // the interval's saved rows
     EXPECT_EQ("", analyzer_->resumePosition().file);
   }
+}
+
+// An interval that cannot be saved at its rollover (a full disk; here a directory where its
+// temporary file goes) keeps its rows; no checkpoint is taken until they are saved, so a crash
+// meanwhile recovers from the one before; once the disk takes them, both follow.
+TEST_F(CheckpointTest, UnsavedIntervalIsKeptAndPutsCheckpointsOff) {
+  Read(0, 4);  // 2 sampled
+  ASSERT_TRUE(analyzer_->writeCheckpoint());
+  Read(4, 6);  // 1 more
+  const std::string blocker = dir_.file("dpx/." + std::to_string(kStart) + "_1_q7appot.dat.tmp");
+  std::filesystem::create_directories(blocker);
+  now_ = kStart + 301;
+  analyzer_->rollover();
+  EXPECT_EQ(0, SavedRequests(kStart));
+  Read(6, 8);  // the checkpoint due after the rollover is put off
+  ASSERT_EQ(history::CheckpointFile::Load::kLoaded,
+            history::CheckpointFile(checkpoint()).load(&image_));
+  EXPECT_EQ(400, PositionOf(image_));
+
+  std::filesystem::remove(blocker);
+  now_ += 1;
+  Read(8, 10);
+  EXPECT_EQ(3, SavedRequests(kStart));
+  ASSERT_EQ(history::CheckpointFile::Load::kLoaded,
+            history::CheckpointFile(checkpoint()).load(&image_));
+  EXPECT_EQ(900, PositionOf(image_));
 }
 
 // A checkpoint that cannot be written leaves the previous one whole, and processing goes on.

@@ -104,6 +104,17 @@ void CDPXDataFileMonitor::waitForCompletion(int seconds) const {
   }
 }
 
+void CDPXDataFileMonitor::waitUntilFinished(int seconds) const {
+  waitForCompletion(seconds);
+  // Stopping it now would skip the rest of its file for good, since reading goes on with newer
+  // files: a reader held up by a busy analyzer is waited for, unless the agent is stopping.
+  while (!completed.load() && sink != nullptr && !sink->isShutdownRequested()) {
+    CLOG::min("%s [%s] is still being read after %d s; waiting for the rest",
+              "CDPXDataFileMonitor::waitUntilFinished", getFile(), seconds);
+    waitForCompletion(seconds);
+  }
+}
+
 bool CDPXDataFileMonitor::isValidTrans(const CDPXTransaction& transaction,
                                        int excludeOutlierMillis) {
   if (excludeOutlierMillis < 0 || transaction.getTotalResponseTime() < excludeOutlierMillis) {
@@ -148,7 +159,7 @@ std::unique_ptr<CDPXDataFileMonitor> CDPXDataFileMonitor::processStatically(
   monitor->setExcludeOutlierMillis(excludeOutlierMillis);
   monitor->setSink(sink);
   monitor->Start();
-  monitor->waitForCompletion(kStaticWaitSeconds);
+  monitor->waitUntilFinished(kStaticWaitSeconds);
   monitor->Shutdown();
   monitor->Join();
   return monitor;

@@ -43,6 +43,9 @@ class CDPXDataFileMonitor : public CDataFileMonitor {
   bool wasInterrupted() const { return interrupted.load(); }
   // Waits until Run has returned or seconds have passed, testing every 100 ms.
   void waitForCompletion(int seconds) const;
+  // The same, but after seconds goes on waiting (traced every seconds) until Run has returned
+  // or the sink is shutting down.
+  void waitUntilFinished(int seconds) const;
 
   // Where records go (not owned). Unset, Run reads nothing and traces why.
   void setSink(TransactionSink* sink) { this->sink = sink; }
@@ -56,10 +59,10 @@ class CDPXDataFileMonitor : public CDataFileMonitor {
   // the configured collector data directory. True with the name copied to newName (size bytes).
   static bool getNewLegacyFilename(const char* file, char* newName, int size);
 
-  // Reads file from offset to its current end with a static monitor and waits up to 30 s for
-  // it, as the file manager and the rename handling do. The monitor gets excludeOutlierMillis
-  // and sink. Returns the monitor's final state (stopped and joined)
-  // so the caller can see where it got to.
+  // Reads file from offset to its current end with a static monitor and waits for it (in
+  // 30 s steps, traced, until it is done or the sink shuts down), as the file manager and the
+  // rename handling do. The monitor gets excludeOutlierMillis and sink. Returns the monitor's
+  // final state (stopped and joined) so the caller can see where it got to.
   static std::unique_ptr<CDPXDataFileMonitor> processStatically(const char* file, long long offset,
                                                                 int excludeOutlierMillis,
                                                                 TransactionSink* sink);

@@ -2,12 +2,14 @@
 
 #include <cstdio>
 #include <cstring>
+#include <string>
 
 #include "core/analyzer/intake/common.h"
 #include "core/analyzer/intake/dpx_data_file_monitor.h"
 #include "core/config/cconfig.h"
 #include "core/runtime/clog.h"
 #include "core/runtime/misc.h"
+#include "core/runtime/set_aside.h"
 
 namespace {
 
@@ -33,7 +35,21 @@ CDPXFileManager::~CDPXFileManager() {
 }
 
 void CDPXFileManager::objectInit() {
-  _LAST_FILE_INFO* const list = getLastProcessedFile();
+  _LAST_FILE_INFO* list = getLastProcessedFile();
+  // A record of another type, or a file holding no whole record, is not a position this agent
+  // wrote: resuming from it would skip or repeat records at random.
+  char path[kPersistSpecSize];
+  long long size = 0;
+  if (getPersistFileSpec(path, sizeof(path)) && CMisc::getFileSize64(path, &size) && size > 0) {
+    if (list == nullptr) {
+      SetAsideTraced("Last processed file record", path, "no whole record");
+    } else if (list->recordType != 1) {
+      SetAsideTraced("Last processed file record", path,
+                     "record type " + std::to_string(list->recordType) + ", not 1");
+      freeLastProcessedFile(list);
+      list = nullptr;
+    }
+  }
   if (list != nullptr) {
     CLOG::min("Found last processed file of [%s] offset[%lu] offsetHigh[%lu]", list->fileName,
               static_cast<unsigned long>(list->offset),
@@ -89,7 +105,7 @@ void CDPXFileManager::startANewMonitor() {
 void CDPXFileManager::stopCurrentMonitor(bool finishFile) {
   if (finishFile) {
     currentMonitor->setStatic();
-    currentMonitor->waitForCompletion(kFinishWaitSeconds);
+    currentMonitor->waitUntilFinished(kFinishWaitSeconds);
     currentMonitor->Shutdown();
     currentMonitor->Join();
   } else {

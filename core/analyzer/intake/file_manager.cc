@@ -63,7 +63,8 @@ bool CFileManager::persistLastProcessedFile(_LAST_FILE_INFO* list) {
   // Replaced whole, never rewritten in place: a crash or a power cut while saving leaves the
   // previous record, from which the next start resumes, rather than an empty file.
   fw::ReplaceResult result;
-  if (fw::ReplaceFile(path, image, {0600, ""}, &result) == fw::kOk) {
+  // A fixed temporary name: what a crash left behind is overwritten by the next save.
+  if (fw::ReplaceFile(path, image, {0600, std::string(path) + ".tmp"}, &result) == fw::kOk) {
     return true;
   }
   switch (result.failed) {

@@ -6,12 +6,15 @@
 
 #include <cstring>
 #include <filesystem>
+#include <fstream>
+#include <iterator>
 #include <memory>
 #include <string>
 #include <vector>
 
 #include "core/analyzer/intake/dpx_file_manager.h"
 #include "core/analyzer/intake/intake_fixture.h"
+#include "framework/trace_capture.h"
 
 namespace q7test {
 namespace {
@@ -101,6 +104,33 @@ TEST_F(FileManagerTest, ReadsEveryWholeRecordLastFirst) {
   EXPECT_STREQ("one.sm3", list->next->fileName);
   EXPECT_EQ(nullptr, list->next->next);
   freeLastProcessedFile(list);
+}
+
+// A record of another type, or a file too short for one, is set aside and named in the trace;
+// the manager starts with no last processed file.
+TEST_F(FileManagerTest, ForeignOrCutPersistFileIsSetAside) {
+  {
+    CDPXFileManager writer;
+    _LAST_FILE_INFO record;
+    std::strcpy(record.fileName, "one.sm3");
+    ASSERT_TRUE(writer.persistLastProcessedFile(&record));
+  }
+  std::string bytes;
+  {
+    std::ifstream in(persistPath(), std::ios::binary);
+    bytes.assign(std::istreambuf_iterator<char>(in), {});
+  }
+  std::string foreign = bytes;
+  foreign[0] = 9;
+  for (const std::string& damaged : {bytes.substr(0, 100), foreign}) {
+    std::ofstream(persistPath(), std::ios::binary | std::ios::trunc) << damaged;
+    fw::TraceCapture capture("*=ALL");
+    CDPXFileManager manager;
+    EXPECT_EQ("", manager.getLastProcessedFileName());
+    EXPECT_TRUE(capture.contains("Last processed file record " + persistPath() + " does not load"));
+    EXPECT_TRUE(capture.contains("Found NO last processed file info"));
+    EXPECT_TRUE(std::filesystem::exists(persistPath() + ".bad"));
+  }
 }
 
 // The persist path is the history directory and "DPXLastFile" glued together, if it fits.

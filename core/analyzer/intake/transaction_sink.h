@@ -18,8 +18,9 @@
 // Kinds of queued transaction records.
 inline constexpr uint32_t TRANSACTION_KIND_DPX = 5;
 inline constexpr uint32_t TRANSACTION_KIND_SUBTX = 6;
-// A read position (CPositionMark) queued after the records it follows, not a transaction.
-inline constexpr uint32_t TRANSACTION_KIND_POSITION = 7;
+// A read position (CPositionMark) queued after the records it follows, not a transaction; an
+// agent-private code, far from the record kinds.
+inline constexpr uint32_t TRANSACTION_KIND_POSITION = 1000;
 
 class TransactionSink {
  public:
