@@ -107,7 +107,7 @@ soak: build
 FUZZ_SECONDS ?= 60
 FUZZ_SMOKE_SECONDS ?= 20
 FUZZ_TARGETS := sm3_fuzz http_parser_fuzz capture_fuzz config_fuzz properties_fuzz api_fuzz \
-                history_fuzz
+                history_fuzz checkpoint_fuzz
 # Each target's corpus (under build-fuzz/), seeds (under tests/fuzz/) and options; by default
 # corpus_<target> and seeds_<target>.
 FUZZ_CORPUS_sm3_fuzz := corpus
@@ -119,6 +119,7 @@ FUZZ_OPTS_config_fuzz := -max_len=4096 -dict=$(CURDIR)/tests/fuzz/config.dict
 FUZZ_OPTS_properties_fuzz := -max_len=8192 -dict=$(CURDIR)/tests/fuzz/properties.dict
 FUZZ_OPTS_api_fuzz := -max_len=2048 -dict=$(CURDIR)/tests/fuzz/api.dict
 FUZZ_OPTS_history_fuzz := -max_len=16384
+FUZZ_OPTS_checkpoint_fuzz := -max_len=16384
 fuzz_corpus = build-fuzz/$(or $(FUZZ_CORPUS_$(1)),corpus_$(1))
 fuzz_seeds = $(CURDIR)/tests/fuzz/$(or $(FUZZ_SEEDS_$(1)),seeds_$(1))
 # UBSan reports stop the run, so that they count as findings.

@@ -2,6 +2,7 @@
 
 #include <errno.h>
 #include <fcntl.h>
+#include <signal.h>
 #include <unistd.h>
 
 #include <cstdio>
@@ -58,6 +59,15 @@ int CreateTemp(std::string* temp, bool unique) {
   return fd;
 }
 
+// The crash-test hook: the path fragment named by Q7_KILL_DURING_WRITE, read once.
+const std::string& KillDuringWrite() {
+  static const std::string fragment = [] {
+    const char* value = std::getenv("Q7_KILL_DURING_WRITE");
+    return std::string(value != nullptr ? value : "");
+  }();
+  return fragment;
+}
+
 }  // namespace
 
 int ReplaceFile(const std::string& path, std::string_view contents, const ReplaceOptions& options,
@@ -96,8 +106,17 @@ int ReplaceFileInPieces(const std::string& path,
   // blocks that were never written. The time is taken before the rename, which keeps it, so a
   // later write by someone else is never mistaken for this one.
   errno = 0;
+  const bool killMidway =
+      !KillDuringWrite().empty() && path.find(KillDuringWrite()) != std::string::npos;
   bool written = ::fchmod(fd, options.mode) == 0 &&
-                 produce([fd](std::string_view piece) { return WriteAll(fd, piece); }) &&
+                 produce([fd, killMidway](std::string_view piece) {
+                   if (killMidway) {
+                     // Half the first piece reaches the file, then the process dies.
+                     WriteAll(fd, piece.substr(0, piece.size() / 2));
+                     ::raise(SIGKILL);
+                   }
+                   return WriteAll(fd, piece);
+                 }) &&
                  ::fsync(fd) == 0 && ::fstat(fd, &st) == 0;
   const int saved = errno;
   written = ::close(fd) == 0 && written;

@@ -10,6 +10,13 @@
 // fsync of the directory so the rename itself survives a power cut. On failure the temporary
 // file is removed and the old file is left as it was.
 //
+// Crash tests set Q7_KILL_DURING_WRITE to a fragment of a path: the process then kills itself
+// with SIGKILL half-way through writing the first replacement of a file whose path holds it.
+//
+// Crash tests set Q7_KILL_DURING_WRITE to a fragment of a path: the process then kills itself
+// with SIGKILL half-way through writing the first piece of any replacement of a file whose path
+// holds it.
+//
 // Thread safety: a plain function. Concurrent replacements of one path each leave a whole file
 // when every caller lets ReplaceFile name the temporary file (the last rename wins); callers
 // that give a fixed temporary name must not race on it.

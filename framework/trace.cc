@@ -373,8 +373,9 @@ void TraceWrite(std::string_view unit, unsigned cls, std::string_view func, std:
     writer.logger = MakeStderrLogger();
   }
   writer.logger->log(spdlog::level::info, spdlog::string_view_t(body.data(), body.size()));
-  // A crash right after an error must still leave the reason in the file.
-  if (cls & kTraceError) {
+  // A crash (or kill -9) right after an error, or a record written whatever the masks say
+  // (few, and the ones an operator looks for), must still leave it in the file.
+  if ((cls & kTraceError) != 0 || (TraceMask(unit) & cls) == 0) {
     writer.logger->flush();
   }
   if (writer.capturing) {
