@@ -68,6 +68,12 @@ class Reader {
 
 CheckpointFile::CheckpointFile(std::string path) : path_(std::move(path)) {}
 
+uint64_t CheckpointFile::checksum(std::string_view bytes) {
+  Fnv1a hash;
+  hash.add(bytes);
+  return hash.value();
+}
+
 bool CheckpointFile::save(std::string_view description,
                           const std::vector<RecordSection>& sections) const {
   const auto produce = [&](const fw::ContentSink& sink) {
@@ -129,9 +135,7 @@ bool CheckpointFile::parse(std::string_view bytes, CheckpointImage* image, std::
   const std::string_view body = bytes.substr(0, bytes.size() - sizeof(uint64_t));
   uint64_t stored = 0;
   std::memcpy(&stored, bytes.data() + body.size(), sizeof(stored));
-  Fnv1a hash;
-  hash.add(body);
-  if (hash.value() != stored) {
+  if (checksum(body) != stored) {
     *why = "torn or damaged (its checksum does not match)";
     return false;
   }

@@ -62,6 +62,8 @@ class CheckpointFile {
   // Sets the file aside and traces why: for a file whose description the caller cannot use.
   void setAside(const std::string& why) const;
 
+  // The checksum a file ends with, over the bytes before it.
+  static uint64_t checksum(std::string_view bytes);
   // Decodes a whole file's bytes; false with *why when they are not a checkpoint.
   static bool parse(std::string_view bytes, CheckpointImage* image, std::string* why);
 

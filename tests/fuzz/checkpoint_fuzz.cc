@@ -29,14 +29,6 @@ void Check(bool ok, const char* what) {
   }
 }
 
-uint64_t Fnv1a(std::string_view bytes) {
-  uint64_t hash = 0xcbf29ce484222325ull;
-  for (const char c : bytes) {
-    hash = (hash ^ static_cast<unsigned char>(c)) * 0x100000001b3ull;
-  }
-  return hash;
-}
-
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
@@ -51,7 +43,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   }
   std::string bytes(reinterpret_cast<const char*>(data + 1), size - 1);
   if ((data[0] & 1) != 0) {
-    const uint64_t hash = Fnv1a(bytes);
+    const uint64_t hash = history::CheckpointFile::checksum(bytes);
     bytes.append(reinterpret_cast<const char*>(&hash), sizeof(hash));
   }
 
