@@ -4,7 +4,9 @@
 // transaction queue's only consumer: it processes each transaction into the current interval's
 // over-time trees, rolls the trees over at every interval boundary (saving them as history),
 // swaps a past interval's rows in (a cache) for transactions that belong to it, and at shutdown
-// drains the queue and saves everything.
+// drains the queue and saves everything. Behind each pass's records the readers queue a
+// position mark; at those marks it takes its checkpoints (checkpointing.cc), from which a start
+// after a crash resumes exactly.
 //
 // Threads: GetInstance/GetInstanceNoStart from any thread (the first call creates the object);
 // add() from intake threads; the queries, visitTrees and flushInstanceFiles from framework

@@ -6,7 +6,8 @@
 // monitor finishes its file as a static monitor and a new one starts at 0. On its first pass
 // it reads the files written while the agent was down. Shutdown stops the monitor and persists
 // the last processed file and the offset reached in it ("DPXLastFile"); the constructor reads
-// them back, so a restart neither repeats nor misses a record.
+// them back, so a restart neither repeats nor misses a record. After a crash the analyzer's
+// checkpoint is newer: the owner then sets the position with resumeAt before Start.
 //
 // Ownership: the analyzer thread creates it, starts it and calls shutdownAndJoin before
 // draining its queue. The manager owns its monitors; the sink must outlive it.
