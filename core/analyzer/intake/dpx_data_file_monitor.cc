@@ -1,5 +1,7 @@
 #include "core/analyzer/intake/dpx_data_file_monitor.h"
 
+#include <sys/stat.h>
+
 #include <cstring>
 #include <memory>
 #include <string>
@@ -186,6 +188,12 @@ bool CDPXDataFileMonitor::handleLegacyDPXRename() {
     renamed = true;
   }
   if (renamed) {
+    // The file under the live name now: read from 0 once the renamed files are done, and the
+    // end of them (what follows was renamed after it, which this same handling finds).
+    struct stat live {};
+    const bool haveLive = ::stat(getFile(), &live) == 0;
+    const uint64_t liveDevice = haveLive ? static_cast<uint64_t>(live.st_dev) : 0;
+    const uint64_t liveInode = haveLive ? static_cast<uint64_t>(live.st_ino) : 0;
     // The file read so far, found by its identity; else the newest renamed name.
     char newName[kFileInfoMaxPath + 1];
     const std::string same =
@@ -202,15 +210,16 @@ bool CDPXDataFileMonitor::handleLegacyDPXRename() {
           "records.",
           newName, getFile());
       processStatically(newName, getLastProcessedOffset(), getExcludeOutlierMillis(), sink);
-      processLaterRenames(newName);
+      processLaterRenames(newName, liveDevice, liveInode);
     }
     setLastProcessedOffset(0);
-    setReadIdentity(0, 0);
+    setReadIdentity(liveDevice, liveInode);
   }
   return renamed;
 }
 
-void CDPXDataFileMonitor::processLaterRenames(const char* renamed) {
+void CDPXDataFileMonitor::processLaterRenames(const char* renamed, uint64_t liveDevice,
+                                              uint64_t liveInode) {
   std::string prefix = getFile();
   const size_t dot = prefix.find('.');
   if (dot != std::string::npos) {
@@ -220,6 +229,12 @@ void CDPXDataFileMonitor::processLaterRenames(const char* renamed) {
       CCommon::sortFilesByName(CCommon::findFiles(CConfig::getDpxDataDirectory(), "*.sm3"));
   for (const _FILE_INFO_LL* node = list; node != nullptr; node = node->next) {
     const char* name = node->fileName;
+    struct stat st {};
+    if (liveInode != 0 && ::stat(name, &st) == 0 &&
+        static_cast<uint64_t>(st.st_dev) == liveDevice &&
+        static_cast<uint64_t>(st.st_ino) == liveInode) {
+      break;  // the live file, renamed meanwhile: it and what follows are found from it
+    }
     if (std::strncmp(name, prefix.c_str(), prefix.size()) == 0 && std::strchr(name, '-') &&
         std::strcmp(name, getFile()) != 0 && CCommon::newerFile(name, renamed)) {
       CLOG::min("Found [%s], renamed after [%s] and never read. Will process its records.", name,

@@ -77,9 +77,10 @@ class CDPXDataFileMonitor : public CDataFileMonitor {
   // The rename handling of a live monitor; true when the file was found renamed (both offsets
   // are then 0).
   bool handleLegacyDPXRename();
-  // Reads the files the collector renamed after renamed (same prefix, newer by name): the
-  // live name moved on more than once before the monitor noticed, and it read none of them.
-  void processLaterRenames(const char* renamed);
+  // Reads the files the collector renamed after renamed (same prefix, newer by name) up to the
+  // file with the live identity given: the live name moved on more than once before the
+  // monitor noticed, and it read none of them.
+  void processLaterRenames(const char* renamed, uint64_t liveDevice, uint64_t liveInode);
 
   std::atomic<bool> isStatic{false};     // set by the owner, read by the thread
   std::atomic<bool> completed{false};    // set when Run returns

@@ -1,5 +1,7 @@
 #include "core/analyzer/intake/dpx_file_manager.h"
 
+#include <sys/stat.h>
+
 #include <cstdio>
 #include <cstring>
 #include <string>
@@ -86,6 +88,20 @@ void CDPXFileManager::setLastProcessed(const char* file, long long offset) {
   lastProcessedOffset = offset;
 }
 
+void CDPXFileManager::noteNewest(const _FILE_INFO_LL* list) {
+  while (list != nullptr && list->next != nullptr) {
+    list = list->next;
+  }
+  struct stat st {};
+  if (list == nullptr || ::stat(list->fileName, &st) != 0) {
+    listedFile.clear();
+    return;
+  }
+  listedFile = list->fileName;
+  listedDevice = static_cast<uint64_t>(st.st_dev);
+  listedInode = static_cast<uint64_t>(st.st_ino);
+}
+
 void CDPXFileManager::startANewMonitor() {
   CLOG::min("%s Starting a new monitor for [%s] at offset[%lld]",
             "CDPXFileManager::startANewMonitor", lastProcessedFile.c_str(), lastProcessedOffset);
@@ -94,6 +110,10 @@ void CDPXFileManager::startANewMonitor() {
   currentMonitor->setExcludeOutlierMillis(getExcludeOutlierMillis());
   if (!resumeFile.empty() && resumeFile == lastProcessedFile && lastProcessedOffset > 0) {
     currentMonitor->setReadIdentity(resumeDevice, resumeInode);
+  } else if (listedFile == lastProcessedFile) {
+    // The file as listed: renamed before the monitor's first read (reading older files can
+    // take a while), it is found again by identity rather than skipped.
+    currentMonitor->setReadIdentity(listedDevice, listedInode);
   }
   resumeFile.clear();
   currentMonitor->setSink(getSink());
@@ -168,6 +188,7 @@ void CDPXFileManager::Run() {
       CLOG::trace(kSummaryFlag, "%s None found", kWhere);
     } else {
       list = CCommon::sortFilesByName(list);
+      noteNewest(list);
       if (firstPass) {
         firstPass = false;
         list = processOlderFiles(list);

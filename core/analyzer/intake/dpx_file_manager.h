@@ -59,6 +59,8 @@ class CDPXFileManager : public CFileManager, public TransactionFeeder {
   // Reads every file of the sorted list but the newest (as the last processed file says) and
   // returns the list holding only the newest, which becomes the last processed file.
   _FILE_INFO_LL* processOlderFiles(_FILE_INFO_LL* list);
+  // Takes the identity of the newest file of a sorted listing, for the monitor started on it.
+  void noteNewest(const _FILE_INFO_LL* list);
   void startANewMonitor();
   // Stops and deletes the current monitor, keeping the offset it reached. For a rollover it
   // first lets the monitor finish its file as a static monitor.
@@ -70,6 +72,10 @@ class CDPXFileManager : public CFileManager, public TransactionFeeder {
   std::string resumeFile;
   uint64_t resumeDevice = 0;
   uint64_t resumeInode = 0;
+  // The newest file of the last listing and its identity as listed.
+  std::string listedFile;
+  uint64_t listedDevice = 0;
+  uint64_t listedInode = 0;
   long long lastProcessedOffset = 0;
   std::unique_ptr<CDPXDataFileMonitor> currentMonitor;
 };
