@@ -29,7 +29,7 @@ struct TempDir {
 
 std::unique_ptr<CDPXAnalyzer> NewAnalyzer(const TempDir& dir) {
   auto analyzer = std::make_unique<CDPXAnalyzer>(
-      CDPXAnalyzer::Paths{dir.path + "/dpx", dir.path + "/state", "", ""});
+      CDPXAnalyzer::Paths{dir.path + "/dpx", dir.path + "/state", "", "", ""});
   analyzer->startRun();
   return analyzer;
 }

@@ -276,7 +276,8 @@ int main(int argc, char** argv) {
   const auto fileBytes = static_cast<long long>(std::filesystem::file_size(file));
 
   // No data directory: the one monitor below is the only reader, as the bench measures it.
-  CDPXAnalyzer analyzer({CConfig::getDpxOdiDataDirectory(), dir + "/q7state.properties", "", ""});
+  CDPXAnalyzer analyzer(
+      {CConfig::getDpxOdiDataDirectory(), dir + "/q7state.properties", "", "", ""});
   AddPatterns(analyzer);
   AddScalingPatterns(analyzer, patterns);
   const long long residentBefore = ResidentBytes();

@@ -114,7 +114,7 @@ void Run(History kind, const std::vector<std::string>& paths, const char* label,
   char dirName[] = "/tmp/q7bench-sample-XXXXXX";
   const std::string dir = mkdtemp(dirName);
   {
-    CDPXAnalyzer analyzer({dir + "/dpx", dir + "/state", "", ""});
+    CDPXAnalyzer analyzer({dir + "/dpx", dir + "/state", "", "", ""});
     analyzer.newTransactionPattern("all", "All", "*", "All", "*", 1, 1, 0, 100, 300, 99);
     analyzer.startRun();
     short level = 0;

@@ -30,7 +30,7 @@ TEST(LinkedListTest, AppendsInOrderAndFreesPayloads) {
 // runs to its limit.
 TEST(WaitForSituationsTest, NeedsBothKindsOfPattern) {
   q7test::ScratchDir dir;
-  CDPXAnalyzer analyzer({dir.file("dpx"), dir.file("state"), dir.file("data"), ""});
+  CDPXAnalyzer analyzer({dir.file("dpx"), dir.file("state"), dir.file("data"), "", ""});
   fw::TraceCapture capture("*=ALL");
   ASSERT_TRUE(analyzer.newTransactionPattern("t", "A", "*", "T", "*", 0, 1, 0, 100, 500, 99));
   analyzer.waitForSituations(1, 3);
@@ -46,7 +46,7 @@ TEST(WaitForSituationsTest, NeedsBothKindsOfPattern) {
 
 TEST(PerformanceStatsTest, AverageOnlyWhenSomethingWasProcessed) {
   q7test::ScratchDir dir;
-  CDPXAnalyzer analyzer({dir.file("dpx"), dir.file("state"), dir.file("data"), ""});
+  CDPXAnalyzer analyzer({dir.file("dpx"), dir.file("state"), dir.file("data"), "", ""});
   fw::TraceCapture capture("*=ALL");
   analyzer.printPerformanceStats();
   EXPECT_TRUE(capture.contains("Transactions Processed                 : 0"));

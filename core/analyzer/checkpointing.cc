@@ -10,8 +10,11 @@
 // checkpoint's position.
 
 #include <sys/stat.h>
+#include <unistd.h>
 
+#include <cerrno>
 #include <chrono>
+#include <cstring>
 #include <memory>
 #include <string>
 #include <vector>
@@ -154,4 +157,24 @@ bool CDPXAnalyzer::recoverFromCheckpoint() {
   transactionsReceived = 0;
   checkpointDue = true;
   return true;
+}
+
+void CDPXAnalyzer::retireCheckpoint() const {
+  const std::string& path = paths.retiredCheckpointFile;
+  if (path.empty()) {
+    return;
+  }
+  if (::unlink(path.c_str()) != 0) {
+    if (errno != ENOENT) {
+      CLOG::error(
+          "Checkpoints are off, yet the checkpoint %s of an earlier run cannot be "
+          "removed: %s",
+          path.c_str(), std::strerror(errno));
+    }
+    return;
+  }
+  CLOG::min(
+      "Checkpoints are off (KQ7CHECKPOINTSECONDS=0): removed the checkpoint %s of an earlier "
+      "run, which would undo everything saved since were checkpoints turned on again",
+      path.c_str());
 }

@@ -35,9 +35,9 @@ CDPXAnalyzer::Paths DefaultPaths() {
   paths.historyDirectory = CConfig::getDpxOdiDataDirectory();
   paths.stateFile = std::string(CConfig::getBaseDirectory()) + "/q7state.properties";
   paths.dataDirectory = CConfig::getDpxDataDirectory();
-  if (CConfig::getCheckpointSeconds() > 0) {
-    paths.checkpointFile = std::string(CConfig::getBaseDirectory()) + "/q7checkpoint.dat";
-  }
+  const std::string checkpoint = std::string(CConfig::getBaseDirectory()) + "/q7checkpoint.dat";
+  (CConfig::getCheckpointSeconds() > 0 ? paths.checkpointFile : paths.retiredCheckpointFile) =
+      checkpoint;
   return paths;
 }
 
@@ -105,6 +105,9 @@ void CDPXAnalyzer::startRun() {
   // The current interval's rows saved by an earlier run stay the current trees, so a restart
   // within an interval keeps its data; a checkpoint, when there is one, is newer.
   recovered = recoverFromCheckpoint();
+  if (!checkpointFile) {
+    retireCheckpoint();
+  }
   if (!recovered) {
     cache->loadCurrent(getCurrentOverTimeInterval());
   }

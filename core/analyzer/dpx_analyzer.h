@@ -49,6 +49,9 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
     std::string stateFile;         // the last-history-sent state
     std::string dataDirectory;     // where the collector writes; empty: no file manager
     std::string checkpointFile;    // the checkpoint; empty: none taken or read
+    // With checkpoints off, where an earlier run's checkpoint may lie: it is removed at start,
+    // since loading it once checkpoints are on again would undo everything saved since.
+    std::string retiredCheckpointFile;
   };
 
   // The singleton, created on first use; GetInstance also starts its thread.
@@ -164,6 +167,8 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // Loads the checkpoint and puts everything back as it stood then; false when there is none
   // (or it was set aside), leaving everything untouched.
   bool recoverFromCheckpoint() REQUIRES(treeMutex);
+  // Checkpoints off: removes an earlier run's checkpoint (paths.retiredCheckpointFile).
+  void retireCheckpoint() const;
   // False when the interval's rows could not all be saved.
   bool saveIntervalData(long interval) REQUIRES(treeMutex);
   // Saves the intervals whose save failed, oldest first; false while any remains unsaved.

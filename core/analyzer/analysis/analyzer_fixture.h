@@ -48,7 +48,7 @@ class AnalyzerFixture : public ::testing::Test {
   std::unique_ptr<CDPXAnalyzer> NewAnalyzer(bool begin = true, bool checkpoints = false) {
     auto analyzer = std::make_unique<CDPXAnalyzer>(
         CDPXAnalyzer::Paths{dir_.file("dpx"), dir_.file("q7state.properties"), "",
-                            checkpoints ? dir_.file("q7checkpoint.dat") : ""});
+                            checkpoints ? dir_.file("q7checkpoint.dat") : "", ""});
     if (begin) {
       analyzer->startRun();
     }

@@ -210,13 +210,29 @@ TEST_F(CheckpointTest, FailedWriteKeepsThePreviousCheckpoint) {
   // The temporary file cannot be created where a directory stands in the way.
   std::filesystem::create_directories(dir_.file("blocker"));
   analyzer_.reset();
-  auto blocked = std::make_unique<CDPXAnalyzer>(CDPXAnalyzer::Paths{
-      dir_.file("dpx"), dir_.file("q7state.properties"), "", dir_.file("nodir/x/../../blocker")});
+  auto blocked = std::make_unique<CDPXAnalyzer>(
+      CDPXAnalyzer::Paths{dir_.file("dpx"), dir_.file("q7state.properties"), "",
+                          dir_.file("nodir/x/../../blocker"), ""});
   blocked->startRun();
   EXPECT_FALSE(blocked->writeCheckpoint());
   blocked.reset();
   analyzer_ = NewAnalyzer(true, true);
   EXPECT_EQ(200, analyzer_->resumePosition().offset);
+}
+
+// With checkpoints off, an earlier run's checkpoint is removed at start: were checkpoints
+// turned on again later, loading it would put back rows and a position long overtaken.
+TEST_F(CheckpointTest, TurnedOffRemovesTheOldCheckpoint) {
+  Read(0, 4);
+  ASSERT_TRUE(analyzer_->writeCheckpoint());
+  analyzer_.reset();
+  fw::TraceCapture capture("*=ALL");
+  auto off = std::make_unique<CDPXAnalyzer>(
+      CDPXAnalyzer::Paths{dir_.file("dpx"), dir_.file("q7state.properties"), "", "", checkpoint()});
+  off->startRun();
+  EXPECT_FALSE(std::filesystem::exists(checkpoint()));
+  EXPECT_TRUE(capture.contains("removed the checkpoint " + checkpoint()));
+  EXPECT_EQ("", off->resumePosition().file);
 }
 
 }  // namespace
