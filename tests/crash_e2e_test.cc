@@ -212,6 +212,12 @@ class CrashE2ETest : public AgentE2ETest {
     }
   }
 
+  // Transactions the running agent has taken from its queue.
+  long taken(const std::string& address) {
+    int status = 0;
+    return get(address, "/api/v1/agent", &status)["counters"].value("transactions_taken", 0L);
+  }
+
   std::string data_;
   std::unique_ptr<ChildProcess> writer_;
   long resumed_ = 0;  // starts that resumed from a checkpoint, as the last check counted them
@@ -255,9 +261,10 @@ TEST_F(CrashE2ETest, KilledWhileWritingItsFilesEveryRecordCountedOnce) {
   // history at a clean stop, which the SIGTERM asks for.
   for (const std::string fragment : {"q7checkpoint.dat", "DPXLastFile", "_1_q7appot.dat"}) {
     extraEnv_["Q7_KILL_DURING_WRITE"] = fragment;
-    start();
-    std::this_thread::sleep_for(1s);  // let it read and count for a while first
+    const std::string address = start();
     if (fragment != "q7checkpoint.dat") {
+      // Stopped once it has counted records of this run.
+      ASSERT_TRUE(waitFor([&] { return taken(address) > 0; }, 30s)) << fragment;
       agent_->signal(SIGTERM);
     }
     const auto status = agent_->wait(10s);
@@ -288,12 +295,8 @@ TEST_F(CrashE2ETest, FullDiskEveryRecordCountedOnce) {
   ASSERT_TRUE(waitFor([&] { return trace().find("holding") != std::string::npos; }, 60s))
       << "the disk never filled";
   // Ingestion goes on while nothing can be written.
-  int status = 0;
-  const auto taken = [&] {
-    return get(address, "/api/v1/agent", &status)["counters"].value("transactions_taken", 0L);
-  };
-  const long before = taken();
-  EXPECT_TRUE(waitFor([&] { return taken() > before + 500; }, 10s));
+  const long before = taken(address);
+  EXPECT_TRUE(waitFor([&] { return taken(address) > before + 500; }, 10s));
   EXPECT_TRUE(
       waitFor([&] { return trace().find("Checkpoint put off") != std::string::npos; }, 10s));
 
