@@ -80,16 +80,19 @@ tsan: deps
 
 # The concurrency code under ThreadSanitizer (part of make test): the runtime primitives, the
 # situation controller shared by framework threads and the analyzer, the analyzer thread, the
-# intake threads (data file monitors and the file manager), the framework's event rings,
-# event streams, situations and condition waits, and the collector process monitors.
+# intake threads (data file monitors and the file manager), the checkpoint writer, the
+# framework's event rings, event streams, situations and condition waits, and the collector
+# process monitors.
 test-tsan: deps
 	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON \
 	  -DQ7_BUILD_E2E=OFF -DQ7_BUILD_BENCH=OFF
-	cmake --build build-tsan -j $(JOBS) --target runtime_test analyzer_test framework_test tama_test
+	cmake --build build-tsan -j $(JOBS) --target runtime_test analyzer_test framework_test tama_test \
+	  history_test
 	build-tsan/bin/runtime_test --gtest_brief=1
 	build-tsan/bin/tama_test --gtest_brief=1 --gtest_filter='ServiceMonitor*'
 	build-tsan/bin/framework_test --gtest_brief=1 --gtest_filter='Events*:Situations*:CondVar*'
-	build-tsan/bin/analyzer_test --gtest_brief=1 --gtest_filter='Situation*:Processing*:WaitFor*:DataFileMonitor*:FileManager*'
+	build-tsan/bin/analyzer_test --gtest_brief=1 --gtest_filter='Situation*:Processing*:WaitFor*:DataFileMonitor*:FileManager*:Checkpoint*'
+	build-tsan/bin/history_test --gtest_brief=1 --gtest_filter='CheckpointWriter*'
 
 bench: deps
 	cmake -S . -B build-release $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Release -DQ7_BUILD_TESTS=OFF

@@ -9,7 +9,10 @@
 // (longer than the operator's ten, so they come first in matching order), and --keys N gives
 // every record one of N URLs, so the trees hold that many distinct transaction keys and more.
 //
-// Usage: bench_q7bench [--records N] [--patterns N] [--keys N]
+// --checkpoint-seconds N takes a checkpoint every N seconds (none by default) and prints how
+// long the analyzer spent on them.
+//
+// Usage: bench_q7bench [--records N] [--patterns N] [--keys N] [--checkpoint-seconds N]
 
 #include <dirent.h>
 #include <stdlib.h>
@@ -228,6 +231,7 @@ int main(int argc, char** argv) {
   int64_t records = 1000000;
   int patterns = 10;
   int64_t keys = 0;
+  int checkpointSeconds = 0;
   for (int i = 1; i < argc; ++i) {
     if (std::strcmp(argv[i], "--records") == 0 && i + 1 < argc) {
       records = std::atoll(argv[++i]);
@@ -235,13 +239,19 @@ int main(int argc, char** argv) {
       patterns = std::atoi(argv[++i]);
     } else if (std::strcmp(argv[i], "--keys") == 0 && i + 1 < argc) {
       keys = std::atoll(argv[++i]);
+    } else if (std::strcmp(argv[i], "--checkpoint-seconds") == 0 && i + 1 < argc) {
+      checkpointSeconds = std::atoi(argv[++i]);
     } else {
-      std::fprintf(stderr, "usage: %s [--records N] [--patterns N] [--keys N]\n", argv[0]);
+      std::fprintf(stderr,
+                   "usage: %s [--records N] [--patterns N] [--keys N] [--checkpoint-seconds N]\n",
+                   argv[0]);
       return 2;
     }
   }
-  if (records <= 0 || patterns < 10 || keys < 0) {
-    std::fprintf(stderr, "--records must be positive, --patterns at least 10, --keys >= 0\n");
+  if (records <= 0 || patterns < 10 || keys < 0 || checkpointSeconds < 0) {
+    std::fprintf(stderr,
+                 "--records must be positive, --patterns at least 10, --keys and "
+                 "--checkpoint-seconds >= 0\n");
     return 2;
   }
 
@@ -276,8 +286,9 @@ int main(int argc, char** argv) {
   const auto fileBytes = static_cast<long long>(std::filesystem::file_size(file));
 
   // No data directory: the one monitor below is the only reader, as the bench measures it.
-  CDPXAnalyzer analyzer(
-      {CConfig::getDpxOdiDataDirectory(), dir + "/q7state.properties", "", "", ""});
+  CConfig::setCheckpointSeconds(checkpointSeconds);
+  CDPXAnalyzer analyzer({CConfig::getDpxOdiDataDirectory(), dir + "/q7state.properties", "",
+                         checkpointSeconds > 0 ? dir + "/q7checkpoint.dat" : "", ""});
   AddPatterns(analyzer);
   AddScalingPatterns(analyzer, patterns);
   const long long residentBefore = ResidentBytes();
@@ -361,6 +372,14 @@ int main(int argc, char** argv) {
       "found empty in %.0f%% of polls\n",
       Seconds(started, readAll), cpu["DPXDataFileMoni"], cpu["Analyzer"],
       100.0 * emptyPolls / std::max(polls, 1));
+  if (checkpointSeconds > 0) {
+    const CDPXAnalyzer::CheckpointStats& stats = analyzer.getCheckpointStats();
+    std::printf(
+        "checkpoints every %d s: %lld written; longest analyzer pause (rows copied) %lld ms, "
+        "longest write %lld ms\n",
+        checkpointSeconds, stats.written.load(), stats.longestCopyMillis.load(),
+        stats.longestWriteMillis.load());
+  }
   if (analyzer.getRolloverCount() > 0) {
     std::printf("note: an over-time interval ended during the run\n");
   }

@@ -91,6 +91,7 @@ void describeAnalyzer(nlohmann::json& out) {
                  : thread == CvelThread::kStateFinished ? "stopped"
                                                         : "not started";
   const IntakeCounters::Snapshot intake = analyzer->intakeCounters().snapshot();
+  const CDPXAnalyzer::CheckpointStats& checkpoints = analyzer->getCheckpointStats();
   out["counters"] = {{"records_read", intake.recordsRead},
                      {"records_unparsed", intake.recordsUnparsed},
                      {"outliers_dropped", intake.outliersDropped},
@@ -98,6 +99,9 @@ void describeAnalyzer(nlohmann::json& out) {
                      {"transactions_ignored", analyzer->getTransactionsIgnored()},
                      {"transactions_taken", analyzer->getTransactionsTaken()},
                      {"queue_depth", analyzer->getQueueDepth()},
+                     {"checkpoints_written", checkpoints.written.load()},
+                     {"checkpoint_pause_ms_max", checkpoints.longestCopyMillis.load()},
+                     {"checkpoint_write_ms_max", checkpoints.longestWriteMillis.load()},
                      {"file", intake.file},
                      {"offset", intake.offset}};
 }

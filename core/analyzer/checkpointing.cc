@@ -12,10 +12,12 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstring>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -25,6 +27,7 @@
 #include "core/analyzer/situation_controller.h"
 #include "core/config/cconfig.h"
 #include "core/history/checkpoint_file.h"
+#include "core/history/checkpoint_writer.h"
 #include "core/history/history_store.h"
 #include "core/history/instance_file.h"
 #include "core/runtime/clog.h"
@@ -46,10 +49,14 @@ void CDPXAnalyzer::notePosition(const ReadPosition& noted) {
   if (!checkpointFile) {
     return;
   }
+  collectCheckpoint(false);
+  if (checkpointWriter->busy()) {
+    return;  // the one before is still being written: this mark waits for the next
+  }
   // After a rollover at once, but a failing one is tried at most once a second.
   const long now = fw::Now();
   if (now - lastCheckpointAt >= (checkpointDue ? 1 : CConfig::getCheckpointSeconds())) {
-    writeCheckpoint();
+    startCheckpoint();
   }
 }
 
@@ -57,42 +64,93 @@ bool CDPXAnalyzer::writeCheckpoint() {
   if (!checkpointFile) {
     return false;
   }
+  collectCheckpoint(true);
+  return startCheckpoint() && collectCheckpoint(true);
+}
+
+void CDPXAnalyzer::awaitCheckpoint() {
+  if (checkpointFile) {
+    collectCheckpoint(true);
+  }
+}
+
+bool CDPXAnalyzer::startCheckpoint() {
   lastCheckpointAt = fw::Now();
-  CvelMutexLock lock(treeMutex);
-  // A past interval's rows swapped in are saved as that interval's; the checkpoint holds the
-  // current interval's.
-  cache->flush();
-  // A checkpoint says what the files hold: while an ended interval or instance records are
-  // still unwritten (a full disk), the previous checkpoint stays the one to recover from.
-  if (!saveUnsaved() || !instanceFile->flush() || !subInstanceFile->flush()) {
-    if (!checkpointPutOff) {
-      CLOG::min("Checkpoint put off: history or instance records are not written yet");
+  const auto began = std::chrono::steady_clock::now();
+  history::CheckpointJob job;
+  PendingCheckpoint pending;
+  {
+    CvelMutexLock lock(treeMutex);
+    // A past interval's rows swapped in are saved as that interval's; the checkpoint holds
+    // the current interval's.
+    cache->flush();
+    // A checkpoint says what the files hold: while an ended interval or instance records are
+    // still unwritten (a full disk), the previous checkpoint stays the one to recover from.
+    if (!saveUnsaved() || !instanceFile->flush() || !subInstanceFile->flush()) {
+      if (!checkpointPutOff) {
+        CLOG::min("Checkpoint put off: history or instance records are not written yet");
+      }
+      checkpointPutOff = true;
+      return false;
     }
-    checkpointPutOff = true;
+    checkpointPutOff = false;
+    CheckpointState state;
+    state.sequence = checkpointSequence + 1;
+    state.interval = getCurrentOverTimeInterval();
+    state.written = lastCheckpointAt;
+    state.position = position;
+    state.instanceLevel = lastInstanceLevel;
+    state.oldTransactions = oldTransactions;
+    state.transactionsReceived = transactionsReceived;
+    for (const char* stem : kInstanceStems) {
+      state.instanceFiles.push_back(
+          {stem, state.interval, FileBytes(history->pathOf(state.interval, stem))});
+    }
+    state.patterns = situations().getPatternCounters();
+    // A copy of the rows: the file is written after the lock is given up, on the writer's
+    // thread, while processing goes on.
+    job.sections = history::CopySections(cache->currentIntervalTrees().sections());
+    job.description = state.encode();
+    job.sequence = state.sequence;
+    pending = {state.sequence, static_cast<long>(state.interval), position,
+               cache->currentIntervalTrees().totalRows(), 0};
+  }
+  pending.copyMillis = std::chrono::duration_cast<std::chrono::milliseconds>(
+                           std::chrono::steady_clock::now() - began)
+                           .count();
+  checkpointStats.longestCopyMillis.store(
+      std::max(checkpointStats.longestCopyMillis.load(), pending.copyMillis));
+  if (!checkpointWriter->start(std::move(job))) {
+    return false;  // callers wait for the one before first
+  }
+  pendingCheckpoint = pending;
+  return true;
+}
+
+bool CDPXAnalyzer::collectCheckpoint(bool wait) {
+  const std::optional<history::CheckpointResult> result =
+      wait ? checkpointWriter->wait() : checkpointWriter->finished();
+  if (!result || !pendingCheckpoint || pendingCheckpoint->sequence != result->sequence) {
     return false;
   }
-  checkpointPutOff = false;
-  CheckpointState state;
-  state.sequence = checkpointSequence + 1;
-  state.interval = getCurrentOverTimeInterval();
-  state.written = lastCheckpointAt;
-  state.position = position;
-  state.instanceLevel = lastInstanceLevel;
-  state.oldTransactions = oldTransactions;
-  state.transactionsReceived = transactionsReceived;
-  for (const char* stem : kInstanceStems) {
-    state.instanceFiles.push_back(
-        {stem, state.interval, FileBytes(history->pathOf(state.interval, stem))});
-  }
-  state.patterns = situations().getPatternCounters();
-  if (!checkpointFile->save(state.encode(), cache->currentIntervalTrees().sections())) {
+  const PendingCheckpoint done = *std::exchange(pendingCheckpoint, std::nullopt);
+  if (!result->written) {
     return false;  // traced; tried again when the next one falls due
   }
-  checkpointSequence = state.sequence;
-  checkpointDue = false;
-  CLOG::med("Checkpoint %llu of interval[%ld] at [%s] offset[%lld]",
-            static_cast<unsigned long long>(state.sequence), static_cast<long>(state.interval),
-            position.file.c_str(), position.offset);
+  checkpointSequence = done.sequence;
+  // One of the interval that began with the last rollover: the ended one is safe.
+  if (done.interval == referenceInterval.load()) {
+    checkpointDue = false;
+  }
+  checkpointStats.written.fetch_add(1);
+  checkpointStats.longestWriteMillis.store(std::max(checkpointStats.longestWriteMillis.load(),
+                                                    static_cast<long long>(result->took.count())));
+  CLOG::med(
+      "Checkpoint %llu of interval[%ld] at [%s] offset[%lld] (%ld rows, %.1f MB; copied in %lld "
+      "ms, written in %lld ms)",
+      static_cast<unsigned long long>(done.sequence), done.interval, done.position.file.c_str(),
+      done.position.offset, done.rows, static_cast<double>(result->bytes) / 1e6, done.copyMillis,
+      static_cast<long long>(result->took.count()));
   return true;
 }
 

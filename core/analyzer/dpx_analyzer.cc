@@ -13,6 +13,7 @@
 #include "core/analyzer/situation_controller.h"
 #include "core/config/cconfig.h"
 #include "core/history/checkpoint_file.h"
+#include "core/history/checkpoint_writer.h"
 #include "core/history/history_store.h"
 #include "core/history/instance_file.h"
 #include "core/history/state_file.h"
@@ -81,6 +82,7 @@ CDPXAnalyzer::CDPXAnalyzer(Paths p)
   state->load();
   if (!paths.checkpointFile.empty()) {
     checkpointFile = std::make_unique<history::CheckpointFile>(paths.checkpointFile);
+    checkpointWriter = std::make_unique<history::CheckpointWriter>(*checkpointFile);
   }
 }
 

@@ -15,8 +15,10 @@
 
 #include <atomic>
 #include <cstddef>
+#include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <utility>
 #include <vector>
 
@@ -37,6 +39,7 @@ class SummaryFoldCache;
 namespace history {
 class CheckpointFile;
 class HistoryStore;
+class CheckpointWriter;
 class InstanceFile;
 class StateFile;
 }  // namespace history
@@ -135,9 +138,20 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // checkpoint when one is due.
   void notePosition(const ReadPosition& position);
   // Saves the checkpoint now: the current interval's rows, the position noted last, the
-  // instance files' lengths and the patterns' counters. False (traced) when it could not be
-  // written; the next is tried at the next due time.
+  // instance files' lengths and the patterns' counters. Waits for it (and for one being
+  // written). False (traced) when it could not be written; the next is tried when due.
   bool writeCheckpoint();
+  // Waits until the checkpoint being written, if any, is on disk (tests; the stop).
+  void awaitCheckpoint();
+  // What checkpoints cost; any thread.
+  struct CheckpointStats {
+    std::atomic<long long> written{0};
+    std::atomic<long long> longestCopyMillis{0};   // the analyzer's pause, rows copied
+    std::atomic<long long> longestWriteMillis{0};  // on the writer's thread
+  };
+  const CheckpointStats& getCheckpointStats() const {
+    return checkpointStats;
+  }
   // Where startRun's checkpoint says reading resumes; empty file name without one.
   const ReadPosition& resumePosition() const {
     return resumeAt;
@@ -198,8 +212,26 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   int rolloverCount = 0;        // analyzer thread
   short lastInstanceLevel = 0;  // analyzer thread: the level of the last page
 
+  // Starts a checkpoint: copies what it holds under the tree lock and hands it to the writer.
+  // False when it is put off (unwritten records) or the writer is busy.
+  bool startCheckpoint();
+  // Takes the writer's result for the pending checkpoint (waiting for it when wait); true
+  // when it was written.
+  bool collectCheckpoint(bool wait);
+
   // Checkpoints; all analyzer thread. Null file: checkpoints are off.
   std::unique_ptr<history::CheckpointFile> checkpointFile;
+  // Writes them; declared after the file, so it is gone (its write finished) before the file.
+  std::unique_ptr<history::CheckpointWriter> checkpointWriter;
+  struct PendingCheckpoint {
+    uint64_t sequence = 0;
+    long interval = 0;
+    ReadPosition position;
+    long rows = 0;
+    long long copyMillis = 0;
+  };
+  std::optional<PendingCheckpoint> pendingCheckpoint;  // handed to the writer
+  CheckpointStats checkpointStats;
   ReadPosition position;   // every record before it is in the trees
   ReadPosition resumeAt;   // the recovered checkpoint's position
   bool recovered = false;  // startRun loaded a checkpoint

@@ -43,6 +43,7 @@ class CheckpointTest : public q7test::AnalyzerFixture {
       Process(Page("shop.example", ("/p" + std::to_string(i)).c_str()));
       if (noted) {
         analyzer_->notePosition({"/data/live.sm3", 0, 0, 100LL * (i + 1)});
+        analyzer_->awaitCheckpoint();  // one the note started is on disk
       }
     }
   }
