@@ -22,15 +22,17 @@ void installRowQueries() {
   q7tema::SetRowQuery<kq7_q7##name##_data_t>([](int sampleType, int* count) {    \
     return CDPXAnalyzer::GetInstanceNoStart()->get_tbl##name(sampleType, count); \
   });
-#define Q7_ROW_QUERY_EXPORTED(name) Q7_ROW_QUERY(name)
-#define Q7_ROW_QUERY_HISTORY_ONLY(name)
-#define Q7_OVER_TIME_QUERY(name, Row, keys, Tree, EXPORT) Q7_ROW_QUERY_##EXPORT(name)
-#define Q7_SUMMARY_QUERY(name, Row, keys, overTime)                                         \
+// Queries that copy no more rows than the sample wants.
+#define Q7_LIMITED_ROW_QUERY(name)                                                          \
   q7tema::SetLimitedRowQuery<kq7_q7##name##_data_t>(                                        \
       [](int sampleType, std::size_t limit, int* count) {                                   \
         return CDPXAnalyzer::GetInstanceNoStart()->get_tbl##name(sampleType, count, limit); \
       });
-#define Q7_CURRENT_QUERY(name, overTime, COLUMNS) Q7_ROW_QUERY(name)
+#define Q7_ROW_QUERY_EXPORTED(name) Q7_LIMITED_ROW_QUERY(name)
+#define Q7_ROW_QUERY_HISTORY_ONLY(name)
+#define Q7_OVER_TIME_QUERY(name, Row, keys, Tree, EXPORT) Q7_ROW_QUERY_##EXPORT(name)
+#define Q7_SUMMARY_QUERY(name, Row, keys, overTime) Q7_LIMITED_ROW_QUERY(name)
+#define Q7_CURRENT_QUERY(name, overTime, COLUMNS) Q7_LIMITED_ROW_QUERY(name)
   Q7_ANALYZER_TABLES(Q7_OVER_TIME_QUERY, Q7_SUMMARY_QUERY, Q7_CURRENT_QUERY, Q7_ROW_QUERY)
 #undef Q7_CURRENT_QUERY
 #undef Q7_SUMMARY_QUERY
@@ -38,6 +40,7 @@ void installRowQueries() {
 #undef Q7_ROW_QUERY_HISTORY_ONLY
 #undef Q7_ROW_QUERY_EXPORTED
 #undef Q7_ROW_QUERY
+#undef Q7_LIMITED_ROW_QUERY
   q7tema::SetRowQuery<kq7_q7agntdts_data_t>(&getAgentDetailRows);
   q7tema::SetRowQuery<kq7_q7agntmsgs_data_t>(&getAgentMessageRows);
   q7tema::SetRowQuery<kq7_q7txptns_data_t>([](int sampleType, int* count) {

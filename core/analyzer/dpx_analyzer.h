@@ -81,11 +81,13 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // ---- Table queries (table_queries.cc). Each returns a new[] array of table rows the caller
   // releases with delete[], and their count through count (null with 0). Only sample type 3
   // yields rows. The public ones take the tree lock, flush the cache and stamp sampletime; the
-  // inner ones (i_get_tbl...) run with the lock held. A summary query answers only the first
-  // limit rows when given one. ----
-#define Q7_DECLARE_OVER_TIME_QUERY(name, Row, keys, Tree, EXPORT)                      \
-  kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count);                    \
-  kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count, bool currentOnly) \
+  // inner ones (i_get_tbl...) run with the lock held. Summary, over-time and current-status
+  // queries answer only the first limit rows when given one, and copy no more. ----
+#define Q7_DECLARE_OVER_TIME_QUERY(name, Row, keys, Tree, EXPORT)                          \
+  kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count,                         \
+                                       std::size_t limit = static_cast<std::size_t>(-1));  \
+  kq7_q7##name##_data_t* i_get_tbl##name(int sampleType, int* count, bool currentOnly,     \
+                                         std::size_t limit = static_cast<std::size_t>(-1)) \
       REQUIRES(treeMutex);
 #define Q7_DECLARE_QUERY(name)                                      \
   kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count); \
@@ -94,8 +96,9 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count, \
                                        std::size_t limit = static_cast<std::size_t>(-1));
   // Current-status rows: the current interval's over-time rows without aggby.
-#define Q7_DECLARE_CURRENT_QUERY(name, overTime, COLUMNS) \
-  kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count);
+#define Q7_DECLARE_CURRENT_QUERY(name, overTime, COLUMNS)          \
+  kq7_q7##name##_data_t* get_tbl##name(int sampleType, int* count, \
+                                       std::size_t limit = static_cast<std::size_t>(-1));
   Q7_ANALYZER_TABLES(Q7_DECLARE_OVER_TIME_QUERY, Q7_DECLARE_SUMMARY_QUERY, Q7_DECLARE_CURRENT_QUERY,
                      Q7_DECLARE_QUERY)
 #undef Q7_DECLARE_CURRENT_QUERY

@@ -70,11 +70,12 @@ struct HistoryWindow {
 };
 
 // A query of over-time rows: tree's rows (the current interval's), then, unless currentOnly,
-// the history of stem before the current interval.
+// the history of stem before the current interval; the first limit of them.
 template <class OverTimeRow>
 typename OverTimeRow::LayoutType* OverTimeRows(TSAVLTree& tree, const char* stem,
                                                const HistoryWindow& history, const char* where,
-                                               int sampleType, int* count, bool currentOnly) {
+                                               int sampleType, int* count, bool currentOnly,
+                                               size_t limit) {
   using Layout = typename OverTimeRow::LayoutType;
   CLOG::enter(2, "%s(%d,--,%d)", where, sampleType, currentOnly ? 1 : 0);
   *count = 0;
@@ -83,11 +84,14 @@ typename OverTimeRow::LayoutType* OverTimeRows(TSAVLTree& tree, const char* stem
     return nullptr;
   }
   const long from = history.interval - history.length;
-  const size_t historyRows = currentOnly
-                                 ? 0
-                                 : Capped(history.store.countRows(stem, from, history.intervals,
-                                                                  history.length, sizeof(Layout)));
-  const size_t current = static_cast<size_t>(tree.getSize());
+  // Only the rows wanted are copied: this runs under the tree lock, which processing waits for.
+  const size_t current = std::min(static_cast<size_t>(tree.getSize()), limit);
+  const size_t historyRows =
+      currentOnly || current == limit
+          ? 0
+          : std::min(Capped(history.store.countRows(stem, from, history.intervals, history.length,
+                                                    sizeof(Layout))),
+                     limit - current);
   if (historyRows + current == 0) {
     CLOG::exit(2, "%s(%d,%d)", where, sampleType, *count);
     return nullptr;
@@ -319,13 +323,18 @@ typename SummaryRow::LayoutType* CDPXAnalyzer::summaryQuery(const char* stem,
 // An over-time table: its tree and row class; a summary: its row class, folded from the
 // current rows of its over-time table and that table's history; instance rows from the
 // instance files.
-#define Q7_OVER_TIME(ot, OverTimeRow, keys, Tree, EXPORT)                                          \
-  kq7_q7##ot##_data_t* CDPXAnalyzer::i_get_tbl##ot(int sampleType, int* count, bool currentOnly) { \
-    return OverTimeRows<OverTimeRow>(cache->currentIntervalTrees().tree(OverTimeTable::Tree),      \
-                                     "q7" #ot, Q7_HISTORY_WINDOW, "i_get_tbl" #ot, sampleType,     \
-                                     count, currentOnly);                                          \
-  }                                                                                                \
-  Q7_LOCKED_QUERY(ot, false)
+#define Q7_OVER_TIME(ot, OverTimeRow, keys, Tree, EXPORT)                                        \
+  kq7_q7##ot##_data_t* CDPXAnalyzer::i_get_tbl##ot(int sampleType, int* count, bool currentOnly, \
+                                                   size_t limit) {                               \
+    return OverTimeRows<OverTimeRow>(cache->currentIntervalTrees().tree(OverTimeTable::Tree),    \
+                                     "q7" #ot, Q7_HISTORY_WINDOW, "i_get_tbl" #ot, sampleType,   \
+                                     count, currentOnly, limit);                                 \
+  }                                                                                              \
+  kq7_q7##ot##_data_t* CDPXAnalyzer::get_tbl##ot(int sampleType, int* count, size_t limit) {     \
+    return lockedQuery<kq7_q7##ot##_data_t>(                                                     \
+        [&]() REQUIRES(treeMutex) { return i_get_tbl##ot(sampleType, count, false, limit); },    \
+        count);                                                                                  \
+  }
 #define Q7_SUMMARY(sm, SummaryRow, keys, ot)                                                 \
   kq7_q7##sm##_data_t* CDPXAnalyzer::get_tbl##sm(int sampleType, int* count, size_t limit) { \
     return summaryQuery<SummaryRow>("q7" #ot, summaryFolds->sm, "i_get_tbl" #sm, sampleType, \
@@ -339,29 +348,29 @@ typename SummaryRow::LayoutType* CDPXAnalyzer::summaryQuery(const char* stem,
   }                                                                                              \
   Q7_LOCKED_QUERY(name)
 
-#define Q7_CURRENT_STATUS(cs, ot, COLUMNS)                                     \
-  kq7_q7##cs##_data_t* CDPXAnalyzer::get_tbl##cs(int sampleType, int* count) { \
-    CLOG::enter(2, "%s(%d,--)", "get_tbl" #cs, sampleType);                    \
-    const time_t now = fw::Now();                                              \
-    int overTimeCount = 0;                                                     \
-    std::unique_ptr<kq7_q7##ot##_data_t[]> overTime;                           \
-    {                                                                          \
-      CvelMutexLock lock(treeMutex);                                           \
-      cache->flush();                                                          \
-      overTime.reset(i_get_tbl##ot(sampleType, &overTimeCount, true));         \
-    }                                                                          \
-    *count = 0;                                                                \
-    kq7_q7##cs##_data_t* rows = nullptr;                                       \
-    if (overTime && overTimeCount > 0) {                                       \
-      rows = new kq7_q7##cs##_data_t[overTimeCount];                           \
-      for (int i = 0; i < overTimeCount; ++i) {                                \
-        q7_convert_##ot##_to_##cs(overTime[i], rows[i]);                       \
-      }                                                                        \
-      *count = overTimeCount;                                                  \
-      StampSampleTime(rows, *count, now);                                      \
-    }                                                                          \
-    CLOG::exit(2, "%s(%d,%d)", "get_tbl" #cs, sampleType, *count);             \
-    return rows;                                                               \
+#define Q7_CURRENT_STATUS(cs, ot, COLUMNS)                                                   \
+  kq7_q7##cs##_data_t* CDPXAnalyzer::get_tbl##cs(int sampleType, int* count, size_t limit) { \
+    CLOG::enter(2, "%s(%d,--)", "get_tbl" #cs, sampleType);                                  \
+    const time_t now = fw::Now();                                                            \
+    int overTimeCount = 0;                                                                   \
+    std::unique_ptr<kq7_q7##ot##_data_t[]> overTime;                                         \
+    {                                                                                        \
+      CvelMutexLock lock(treeMutex);                                                         \
+      cache->flush();                                                                        \
+      overTime.reset(i_get_tbl##ot(sampleType, &overTimeCount, true, limit));                \
+    }                                                                                        \
+    *count = 0;                                                                              \
+    kq7_q7##cs##_data_t* rows = nullptr;                                                     \
+    if (overTime && overTimeCount > 0) {                                                     \
+      rows = new kq7_q7##cs##_data_t[overTimeCount];                                         \
+      for (int i = 0; i < overTimeCount; ++i) {                                              \
+        q7_convert_##ot##_to_##cs(overTime[i], rows[i]);                                     \
+      }                                                                                      \
+      *count = overTimeCount;                                                                \
+      StampSampleTime(rows, *count, now);                                                    \
+    }                                                                                        \
+    CLOG::exit(2, "%s(%d,%d)", "get_tbl" #cs, sampleType, *count);                           \
+    return rows;                                                                             \
   }
 Q7_ANALYZER_TABLES(Q7_OVER_TIME, Q7_SUMMARY, Q7_CURRENT_STATUS, Q7_INSTANCE)
 #undef Q7_CURRENT_STATUS

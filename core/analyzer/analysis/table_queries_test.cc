@@ -95,6 +95,40 @@ TEST_F(QueryTest, SummaryFoldsIntervals) {
   EXPECT_EQ("Shop", rows::FieldText(current[0].applicatin, 128));
 }
 
+// A limit gives the first rows of the whole answer (current rows, then history) and copies no
+// more; current-status rows likewise.
+TEST_F(QueryTest, ALimitGivesTheFirstRows) {
+  AddPattern("all", "", "*", "Tx", "*", 100, 0, 1, 1);
+  for (const char* app : {"a.example", "b.example", "c.example"}) {
+    Process(Page(app, "/x"));
+  }
+  now_ = kStart + 300 + 1;
+  analyzer_->rollover();
+  for (const char* app : {"d.example", "e.example"}) {
+    Process(Page(app, "/x"));
+  }
+  int all = 0;
+  auto whole = Own(analyzer_->get_tblappot(3, &all));
+  ASSERT_EQ(5, all);
+  int current = 0;
+  auto wholeCurrent = Own(analyzer_->get_tblappcs(3, &current));
+  ASSERT_EQ(2, current);
+  for (size_t limit : {0, 1, 2, 3, 5, 9}) {
+    int count = -1;
+    auto got = Own(analyzer_->get_tblappot(3, &count, limit));
+    ASSERT_EQ(std::min<int>(all, static_cast<int>(limit)), count) << limit;
+    for (int i = 0; i < count; ++i) {
+      EXPECT_EQ(0, memcmp(&whole[i], &got[i], sizeof(got[i]))) << limit << " row " << i;
+    }
+    auto gotCurrent = Own(analyzer_->get_tblappcs(3, &count, limit));
+    ASSERT_EQ(std::min<int>(current, static_cast<int>(limit)), count) << limit;
+    for (int i = 0; i < count; ++i) {
+      EXPECT_EQ(rows::FieldText(wholeCurrent[i].applicatin, 128),
+                rows::FieldText(gotCurrent[i].applicatin, 128));
+    }
+  }
+}
+
 TEST_F(QueryTest, InstanceRowsFromTheInstanceFiles) {
   AddPattern("all", "Shop", "*", "Checkout", "*/checkout*", 100, 1, 0, 0);
   Process(Page("shop.example", "/shop/checkout", 300, 200));
