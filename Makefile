@@ -30,7 +30,7 @@ DEPS := cmake ninja-build g++ make pkg-config git curl \
 
 SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
 
-.PHONY: all deps build test test-tsan demo bench install asan tsan fuzz fuzz-build fuzz-smoke \
+.PHONY: all deps build test test-tsan demo bench load install asan tsan fuzz fuzz-build fuzz-smoke \
         fuzz-smoke-run soak \
         clean format
 
@@ -106,6 +106,16 @@ SOAK_KILLS ?= 200
 SOAK_MAX_MS ?= 8000
 soak: build
 	Q7_KILLS=$(SOAK_KILLS) Q7_KILL_MAX_MS=$(SOAK_MAX_MS) build/bin/crash_e2e_test
+
+# The agent under load (Release): LOAD_RATE records a second ingested for LOAD_SECONDS while 20
+# clients sample its tables and events; exits non-zero when a request fails, ingestion stalls
+# for over a second or memory grows after the first minute.
+LOAD_RATE ?= 200000
+LOAD_SECONDS ?= 120
+load: deps
+	cmake -S . -B build-release $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Release -DQ7_BUILD_TESTS=OFF
+	cmake --build build-release -j $(JOBS) --target q7load
+	build-release/bin/q7load --rate $(LOAD_RATE) --seconds $(LOAD_SECONDS)
 
 FUZZ_SECONDS ?= 60
 FUZZ_SMOKE_SECONDS ?= 20

@@ -76,12 +76,13 @@ std::optional<FinalRecord> FindFinalRecord(const std::string& path) {
   return final;
 }
 
-bool AgentHome::Prepare(std::string* error) {
+bool AgentHome::Prepare(std::string* error, const std::string& extraConfig) {
   std::filesystem::create_directories(home_ + "config");
   std::filesystem::create_directories(home_ + "logs");
   std::filesystem::create_directories(data());
   std::ofstream(home_ + "config/" + q7test::shortHostName() + "_q7.cfg")
-      << "[AGENT]\nKQ7DPXLOGPATH=" << data() << "\n";
+      << "[AGENT]\nKQ7DPXLOGPATH=" << data() << "\n"
+      << extraConfig;
   CSituationController controller(home_ + "zorvan6/odi/dpx");
   auto pattern = std::make_unique<TransactionPattern>();
   setPatternText(pattern->applicationName, "All");

@@ -43,8 +43,9 @@ class AgentHome {
   // The data directory, without a trailing '/'.
   std::string data() const { return home_ + "data"; }
 
-  // Writes the configuration and the pattern; false with *error when the pattern is refused.
-  bool Prepare(std::string* error);
+  // Writes the configuration (with extraConfig's lines) and the pattern; false with *error
+  // when the pattern is refused.
+  bool Prepare(std::string* error, const std::string& extraConfig = "");
   // Starts the agent (DPX_NOSTART: no collector processes) and waits up to 20 s for its API;
   // returns its address, empty on failure.
   std::string Start();
