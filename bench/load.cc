@@ -548,7 +548,14 @@ int main(int argc, char** argv) {
   agent.Stop();
   const std::string trace = agent.Trace();
   const long errors = std::count(trace.begin(), trace.end(), '\n');
-  std::printf("agent trace: %ld records (errors only by default)\n", errors);
+  std::printf("agent trace: %ld records (errors and what is always written)\n", errors);
+  // Its last few, as a reader of the trace would see them.
+  size_t from = trace.size();
+  for (int n = 0; n < 6 && from > 0; ++n) {
+    from = trace.rfind('\n', from - 2);
+    from = from == std::string::npos ? 0 : from + 1;
+  }
+  std::printf("%s", trace.substr(from).c_str());
 
   // The checks the run is for.
   const bool allProcessed = state.processed >= written;
