@@ -70,7 +70,7 @@ asan: deps
 	  -DCMAKE_C_COMPILER=clang -DCMAKE_CXX_COMPILER=clang++ -DQ7_BUILD_E2E=OFF -DQ7_BUILD_BENCH=OFF
 	cmake --build build-asan -j $(JOBS)
 	cd build-asan && ctest --output-on-failure -j $(JOBS) -L unit --timeout 300
-	$(MAKE) --no-print-directory fuzz-smoke-run FUZZ_DIR=build-asan
+	$(MAKE) --no-print-directory -j $(JOBS) -O fuzz-smoke-run FUZZ_DIR=build-asan
 
 tsan: deps
 	cmake -S . -B build-tsan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_TSAN=ON \
@@ -155,13 +155,16 @@ fuzz: fuzz-build
 
 # Each target briefly from its seeds alone (new inputs go to a scratch corpus); any crash, leak,
 # hang or UBSan report fails. FUZZ_DIR is the build holding the targets: make asan runs the
-# same from build-asan, whose libraries carry the fuzzer's coverage too.
+# same from build-asan, whose libraries carry the fuzzer's coverage too. Targets run JOBS at a
+# time, each one's output kept together.
 FUZZ_DIR ?= build-fuzz
-fuzz-smoke: fuzz-build fuzz-smoke-run
-fuzz-smoke-run:
-	$(foreach t,$(FUZZ_TARGETS),rm -rf $(FUZZ_DIR)/smoke_$(t) && mkdir -p $(FUZZ_DIR)/smoke_$(t)$(newline)\
-	cd $(FUZZ_DIR) && $(FUZZ_ENV) bin/$(t) -max_total_time=$(FUZZ_SMOKE_SECONDS) -timeout=20 \
-	  -print_final_stats=1 $(FUZZ_OPTS_$(t)) smoke_$(t) $(call fuzz_seeds,$(t))$(newline))
+fuzz-smoke: fuzz-build
+	$(MAKE) --no-print-directory -j $(JOBS) -O fuzz-smoke-run
+fuzz-smoke-run: $(addprefix fuzz-smoke-,$(FUZZ_TARGETS))
+fuzz-smoke-%:
+	rm -rf $(FUZZ_DIR)/smoke_$* && mkdir -p $(FUZZ_DIR)/smoke_$*
+	cd $(FUZZ_DIR) && $(FUZZ_ENV) bin/$* -max_total_time=$(FUZZ_SMOKE_SECONDS) -timeout=20 \
+	  -print_final_stats=1 $(FUZZ_OPTS_$*) smoke_$* $(call fuzz_seeds,$*)
 
 install: build
 	cmake --install build --prefix "$(PREFIX)"
