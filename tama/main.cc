@@ -1,6 +1,10 @@
 // q7agent process entry: command line, tracing, then the agent's life in CtMain.
 
+#include <malloc.h>
+#include <unistd.h>
+
 #include <CLI/CLI.hpp>
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <string>
@@ -25,6 +29,7 @@ constexpr char kFooter[] = R"(Environment (options above set the same variables)
   Q7_NODE_NAME     origin node name (default <short host>:Q7)
   DPX_NOSTART      when set, collector processes are neither started nor stopped
   DPX_ZERORECORDS  when set, quiet keys are reported with zero records
+  MALLOC_ARENA_MAX glibc's memory arenas (default here: one per core)
 Files:
   <configdir><host>_q7.cfg         framework configuration (KQ7DPXLOGPATH, ...)
   <configdir>q7details.properties  agent properties (NAME=VALUE lines)
@@ -40,9 +45,20 @@ void setEnvFromOption(const char* name, const std::string& value) {
   }
 }
 
+// By default glibc gives each thread that allocates an arena of its own, up to eight per core,
+// and an arena keeps what it once held: under load the HTTP workers' arenas kept the memory of
+// big samples and summary folds, and the agent grew by 400 MiB it never used again. One arena
+// per core keeps it flat at no cost in throughput; MALLOC_ARENA_MAX still decides when set.
+void limitMallocArenas() {
+  if (std::getenv("MALLOC_ARENA_MAX") == nullptr) {
+    ::mallopt(M_ARENA_MAX, static_cast<int>(std::max(2L, ::sysconf(_SC_NPROCESSORS_ONLN))));
+  }
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
+  limitMallocArenas();
   CLI::App app{"q7agent: response-time monitoring agent for web traffic seen by the collector",
                "q7agent"};
   app.set_version_flag("--version", std::string("q7agent ") + fw::ProductVersion());
