@@ -18,10 +18,6 @@ namespace {
 // transaction the analyzer takes several hundred items meanwhile and never runs dry.
 constexpr unsigned long kFullQueuePauseMillis = 1;
 
-long IntervalSeconds() {
-  return static_cast<long>(CConfig::getOverTimeInterval()) * 60;
-}
-
 }  // namespace
 
 CAnalyzer::CAnalyzer(const char* patternDirectory)
@@ -99,7 +95,8 @@ int32_t CAnalyzer::getQueueDepthHint() const {
 
 void CAnalyzer::updateCurrentOverTimeInterval() {
   const long now = fw::Now();
-  currentOverTimeInterval.store(static_cast<int32_t>(now - (now % IntervalSeconds())));
+  currentOverTimeInterval.store(
+      static_cast<int32_t>(now - (now % CConfig::getOverTimeIntervalSeconds())));
 }
 
 bool CAnalyzer::isNewOverTimeInterval() const {
@@ -108,7 +105,7 @@ bool CAnalyzer::isNewOverTimeInterval() const {
 
 bool CAnalyzer::isNewOverTimeInterval(long interval) const {
   const long now = fw::Now();
-  return now - (now % IntervalSeconds()) != interval;
+  return now - (now % CConfig::getOverTimeIntervalSeconds()) != interval;
 }
 
 bool CAnalyzer::haveSituations() const {

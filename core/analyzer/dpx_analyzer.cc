@@ -78,6 +78,8 @@ CDPXAnalyzer::CDPXAnalyzer(Paths p)
                                                            sizeof(kq7_q7txins_data_t))),
       subInstanceFile(std::make_unique<history::InstanceFile>(paths.historyDirectory, "q7subtxins",
                                                               sizeof(kq7_q7subtxins_data_t))),
+      requestMetrics(
+          std::make_unique<RequestMetrics>(static_cast<size_t>(CConfig::getMetricsMaxSeries()))),
       summaryFolds(std::make_unique<SummaryFolds>()) {
   state->load();
   if (!paths.checkpointFile.empty()) {

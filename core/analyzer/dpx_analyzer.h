@@ -24,6 +24,7 @@
 
 #include "core/analyzer/analysis/interval_cache.h"
 #include "core/analyzer/analysis/over_time_trees.h"
+#include "core/analyzer/analysis/request_metrics.h"
 #include "core/analyzer/analysis/table_queries.h"
 #include "core/analyzer/analyzer.h"
 #include "core/analyzer/intake/read_position.h"
@@ -34,8 +35,10 @@
 class CDPXTransaction;
 struct InstancePatterns;
 struct SummaryFolds;
+template <class Value>
+class HistoryCache;
 template <class SummaryRow>
-class SummaryFoldCache;
+class HistoryFold;
 namespace history {
 class CheckpointFile;
 class HistoryStore;
@@ -111,6 +114,14 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   kq7_q7txptns_data_t* getTransactionPatterns(int sampleType, int* count);
   kq7_q7clntptns_data_t* getClientPatterns(int sampleType, int* count);
 
+  // The latency book of the current interval, or (summary) of the summary period: its saved
+  // intervals, those whose save failed and the current one, merged oldest first
+  // (latency_queries.cc). Any thread.
+  LatencyBook getLatency(bool summary) EXCLUDES(treeMutex);
+
+  // A copy of the page requests counted since the start, for /metrics. Any thread.
+  RequestMetrics getRequestMetrics() const EXCLUDES(treeMutex);
+
   // Intervals in the summary period: summary hours x 60 / over-time minutes.
   static int summaryIntervals();
 
@@ -178,7 +189,7 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   // of that table's history (stem), which folds keeps between queries.
   template <class SummaryRow>
   typename SummaryRow::LayoutType* summaryQuery(const char* stem,
-                                                SummaryFoldCache<SummaryRow>& folds,
+                                                HistoryCache<HistoryFold<SummaryRow>>& folds,
                                                 const char* where, int sampleType, int* count,
                                                 std::size_t limit) EXCLUDES(treeMutex);
   // Loads the checkpoint and puts everything back as it stood then; false when there is none
@@ -204,6 +215,8 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   std::unique_ptr<IntervalCache> cache PT_GUARDED_BY(treeMutex);  // the trees, and the cache
   std::unique_ptr<history::InstanceFile> instanceFile PT_GUARDED_BY(treeMutex);
   std::unique_ptr<history::InstanceFile> subInstanceFile PT_GUARDED_BY(treeMutex);
+  // Every page request counted since the start, for /metrics.
+  std::unique_ptr<RequestMetrics> requestMetrics PT_GUARDED_BY(treeMutex);
   // Ended intervals whose rows could not be saved (a full disk), oldest first.
   std::vector<std::pair<long, std::unique_ptr<COverTimeTrees>>> unsaved GUARDED_BY(treeMutex);
   // Each summary's history fold, kept between queries; locks itself.

@@ -16,6 +16,7 @@
 int CConfig::VOverTimeInterval = CConfig::kDefaultOverTimeInterval;
 int CConfig::VSummaryInterval = CConfig::kDefaultSummaryInterval;
 int CConfig::VCheckpointSeconds = CConfig::kDefaultCheckpointSeconds;
+int CConfig::VMetricsMaxSeries = CConfig::kDefaultMetricsMaxSeries;
 int CConfig::VExcludeOutlierMillis = CConfig::kNoOutlierLimit;
 int CConfig::VMaxThreads = CConfig::kDefaultMaxThreads;
 bool CConfig::VReportZeroRecords = false;
@@ -163,13 +164,20 @@ void CConfig::setCheckpointSeconds(int seconds) {
             VCheckpointSeconds == 0 ? " (checkpoints off)" : "");
 }
 
+void CConfig::setMetricsMaxSeries(int series) {
+  VMetricsMaxSeries = series;
+  if (series < 1) {
+    CLOG::error("Invalid metrics series limit %d", series);
+    VMetricsMaxSeries = kDefaultMetricsMaxSeries;
+  }
+}
+
 void CConfig::setSummaryInterval(int hours) {
   VSummaryInterval = hours;
   if (hours == 0) {
     // The over-time text is reused here deliberately.
     CLOG::error("Invalid Overtime Interval %d", hours);
     VSummaryInterval = kDefaultSummaryInterval;
-    VCheckpointSeconds = kDefaultCheckpointSeconds;
   }
   CLOG::min("Summary Interval set to %d", VSummaryInterval);
 }
@@ -199,6 +207,8 @@ void CConfig::resetForTesting() {
   VExcludeOutlierMillis = kNoOutlierLimit;
   VMaxThreads = kDefaultMaxThreads;
   VReportZeroRecords = false;
+  VCheckpointSeconds = kDefaultCheckpointSeconds;
+  VMetricsMaxSeries = kDefaultMetricsMaxSeries;
   for (char* dir :
        {baseDirectory, logDirectory, odiDataDirectory, armDataDirectory, dpxDataDirectory,
         lynDataDirectory, dpxOdiDataDirectory, armOdiDataDirectory, lynOdiDataDirectory}) {

@@ -19,14 +19,18 @@ class CConfig {
   static constexpr int kDefaultMaxThreads = 40;
   static constexpr int kNoOutlierLimit = -1;
   static constexpr int kDefaultCheckpointSeconds = 10;
+  static constexpr int kDefaultMetricsMaxSeries = 2000;
 
   static int getOverTimeInterval() { return VOverTimeInterval; }
+  static long getOverTimeIntervalSeconds() { return static_cast<long>(VOverTimeInterval) * 60; }
   static int getSummaryInterval() { return VSummaryInterval; }
   static int getExcludeOutlierMillis() { return VExcludeOutlierMillis; }
   static int getMaxThreads() { return VMaxThreads; }
   static bool getReportZeroRecords() { return VReportZeroRecords; }
   // Seconds between the analyzer's checkpoints; 0: none are taken or read.
   static int getCheckpointSeconds() { return VCheckpointSeconds; }
+  // The most application/transaction series /metrics keeps.
+  static int getMetricsMaxSeries() { return VMetricsMaxSeries; }
   static const char* getBaseDirectory() { return baseDirectory; }
   static const char* getLogDirectory() { return logDirectory; }
   static const char* getOdiDataDirectory() { return odiDataDirectory; }
@@ -62,6 +66,8 @@ class CConfig {
   // Negative is invalid: logged as an error and replaced by the default. 0 turns checkpoints
   // off.
   static void setCheckpointSeconds(int seconds);
+  // Below 1 is invalid: logged as an error and replaced by the default.
+  static void setMetricsMaxSeries(int series);
 
   // Restores every default and empties the directories, as at process start.
   static void resetForTesting();
@@ -73,6 +79,7 @@ class CConfig {
   static int VMaxThreads;            // thread limit; no one reads it
   static bool VReportZeroRecords;    // report zero-record rows for some tables
   static int VCheckpointSeconds;     // seconds between checkpoints; 0: none
+  static int VMetricsMaxSeries;      // series /metrics keeps
 
   static char baseDirectory[kDirSize];        // agent base directory
   static char logDirectory[kDirSize];         // base + "/logs/"

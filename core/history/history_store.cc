@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 #include <filesystem>
 #include <optional>
@@ -89,6 +90,8 @@ bool ValidWalk(int intervals, int64_t interval_seconds, size_t record_size, cons
 }
 
 std::atomic<uint64_t> g_generation{0};
+// Nanoseconds every store has spent writing interval files.
+std::atomic<uint64_t> g_writeNanos{0};
 
 // Called once a change is in place, so that a reader seeing the new value reads the change.
 void Advance() {
@@ -96,6 +99,10 @@ void Advance() {
 }
 
 }  // namespace
+
+double HistoryStore::writeSeconds() {
+  return static_cast<double>(g_writeNanos.load()) / 1e9;
+}
 
 uint64_t HistoryStore::generation() {
   return g_generation.load(std::memory_order_acquire);
@@ -123,6 +130,15 @@ bool HistoryStore::saveInterval(int64_t interval, std::string_view stem, const v
 bool HistoryStore::saveIntervalInPieces(int64_t interval, std::string_view stem, size_t record_size,
                                         size_t count, const RecordFill& fill) const {
   static const char* const kWhere = "HistoryStore::saveInterval";
+  const auto started = std::chrono::steady_clock::now();
+  struct Timed {
+    std::chrono::steady_clock::time_point started;
+    ~Timed() {
+      g_writeNanos += static_cast<uint64_t>(std::chrono::duration_cast<std::chrono::nanoseconds>(
+                                                std::chrono::steady_clock::now() - started)
+                                                .count());
+    }
+  } timed{started};
   if (interval < 0) {
     CLOG::error("%s negative interval start %lld for %.*s", kWhere,
                 static_cast<long long>(interval), static_cast<int>(stem.size()), stem.data());

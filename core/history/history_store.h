@@ -92,6 +92,8 @@ class HistoryStore {
   // change counted up to it, so a reader keeping what it derived from the files can tell when
   // it may be stale.
   static uint64_t generation();
+  // Seconds every store of the process has spent writing interval files.
+  static double writeSeconds();
 
  private:
   // Removes the store's regular files whose interval start remove() accepts; traced as where.

@@ -4,7 +4,12 @@
 #include <cmath>
 #include <cstring>
 
+#include "core/analyzer/analysis/byte_codec.h"
+
 namespace {
+
+using bytecodec::Put;
+using bytecodec::Take;
 
 constexpr double kGamma =
     (1 + LatencySketch::kRelativeAccuracy) / (1 - LatencySketch::kRelativeAccuracy);
@@ -15,21 +20,6 @@ constexpr double kSmallest = 1e-3;
 constexpr double kLargest = 3.6e6;
 
 constexpr char kMagic[] = {'q', '7', 's', 'k', 1};
-
-template <class T>
-void Put(std::string* out, const T& value) {
-  out->append(reinterpret_cast<const char*>(&value), sizeof(value));
-}
-
-template <class T>
-bool Take(std::string_view* in, T* value) {
-  if (in->size() < sizeof(T)) {
-    return false;
-  }
-  std::memcpy(value, in->data(), sizeof(T));
-  in->remove_prefix(sizeof(T));
-  return true;
-}
 
 }  // namespace
 

@@ -146,13 +146,14 @@ bool COverTimeTrees::save(history::HistoryStore& store, long interval) const {
   for (int i = 0; i < kOverTimeTables; ++i) {
     saved = kTables[i].save(*trees_[i], store, interval, kTables[i].stem) && saved;
   }
-  return saved;
+  return latency_.save(store, interval) && saved;
 }
 
 void COverTimeTrees::load(history::HistoryStore& store, long interval) {
   for (int i = 0; i < kOverTimeTables; ++i) {
     kTables[i].load(*this, static_cast<OverTimeTable>(i), store, interval, kTables[i].stem);
   }
+  latency_.load(store, interval);
 }
 
 std::vector<history::RecordSection> COverTimeTrees::sections() const {
@@ -160,10 +161,14 @@ std::vector<history::RecordSection> COverTimeTrees::sections() const {
   for (int i = 0; i < kOverTimeTables; ++i) {
     out.push_back(kTables[i].section(*trees_[i], kTables[i].stem));
   }
+  out.push_back(latency_.section());
   return out;
 }
 
 bool COverTimeTrees::loadSection(const history::LoadedSection& section) {
+  if (section.stem == LatencyBook::kStem) {
+    return latency_.loadSection(section);
+  }
   for (int i = 0; i < kOverTimeTables; ++i) {
     if (section.stem == kTables[i].stem) {
       if (section.record_size != kTables[i].recordSize) {

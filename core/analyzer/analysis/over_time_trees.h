@@ -4,12 +4,16 @@
 // them as a set: saving them as the interval's history files, loading an interval's files back
 // into them, and seeding a new interval with zero rows for the keys of the one that ended.
 //
+// Beside the trees, the interval's latency book (the sketches of its application and transaction
+// rows), saved, loaded and checkpointed with them.
+//
 // The trees own their rows. Threads: the analyzer's tree lock guards a set and its rows.
 
 #include <cstddef>
 #include <memory>
 #include <vector>
 
+#include "core/analyzer/analysis/latency_book.h"
 #include "core/analyzer/analysis/row_index.h"
 #include "core/analyzer/rows/analyzer_tables.h"
 #include "core/runtime/ts_avl_tree.h"
@@ -54,17 +58,21 @@ class COverTimeTrees {
   bool add(OverTimeTable table, TreeNode* row, std::size_t hash);
   const TSAVLTree& tree(OverTimeTable table) const { return *trees_[static_cast<int>(table)]; }
   long totalRows() const;
+  LatencyBook& latency() { return latency_; }
+  const LatencyBook& latency() const { return latency_; }
 
-  // Writes every tree as interval's history file (an empty tree leaves an empty file). False
+  // Writes every tree, and the book, as interval's history files (an empty tree leaves an empty
+  // file). False
   // when a file could not be written (traced by the store).
   bool save(history::HistoryStore& store, long interval) const;
-  // Adds interval's history rows to the trees.
+  // Adds interval's history rows to the trees, and its book to the book.
   void load(history::HistoryStore& store, long interval);
-  // Every tree's rows as history records, one section per table (stem "q7<table>"), for a
-  // checkpoint. The sections point into the trees: use them before the trees change.
+  // Every tree's rows as history records, one section per table (stem "q7<table>"), and the
+  // book's section, for a checkpoint. The sections point into the trees: use them before the trees
+  // change.
   std::vector<history::RecordSection> sections() const;
-  // Adds records saved by sections() to the tree of stem; false for a stem no table has or a
-  // record size that is not the table's.
+  // Adds records saved by sections() to the tree of stem (or the book); false for a stem no
+  // table has, a record size that is not the table's or a book that does not decode.
   bool loadSection(const history::LoadedSection& section);
   // Adds, for every key of ended, a row with no requests starting at interval.
   void seedZeroRows(const COverTimeTrees& ended, long interval);
@@ -72,6 +80,7 @@ class COverTimeTrees {
  private:
   std::unique_ptr<TSAVLTree> trees_[kOverTimeTables];
   RowIndex index_[kOverTimeTables];  // over trees_'s rows
+  LatencyBook latency_;
 };
 
 // Every object of tree in its order (left to right), for copying rows out.

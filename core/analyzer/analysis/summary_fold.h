@@ -26,6 +26,7 @@
 #include <utility>
 #include <vector>
 
+#include "core/analyzer/analysis/latency_book.h"
 #include "core/analyzer/rows/base_table.h"
 #include "core/analyzer/rows/rows.h"
 #include "framework/mutex.h"
@@ -169,10 +170,11 @@ class HistoryFold {
   Keys keys_;  // of entries_
 };
 
-// The last history fold of one summary, with what it was folded from: the window and the
-// history store's generation (history::HistoryStore::generation) when its rows were read.
-template <class SummaryRow>
-class SummaryFoldCache {
+// What was last derived from the summary period's history (a summary's fold, the latency
+// books merged), with what it was derived from: the window and the history store's generation
+// (history::HistoryStore::generation) when its files were read.
+template <class Value>
+class HistoryCache {
  public:
   struct Key {
     long from = 0;  // newest interval of the window
@@ -182,39 +184,45 @@ class SummaryFoldCache {
     bool operator==(const Key&) const = default;
   };
 
-  // The fold of exactly key's history, or null.
-  std::shared_ptr<const HistoryFold<SummaryRow>> find(const Key& key) {
+  // The value of exactly key's history, or null.
+  std::shared_ptr<const Value> find(const Key& key) {
     fw::MutexLock lock(mutex_);
-    return fold_ != nullptr && key_ == key ? fold_ : nullptr;
+    return value_ != nullptr && key_ == key ? value_ : nullptr;
   }
-  // Keeps fold as key's, unless a fold of later history is kept already (two queries may fold
-  // at once).
-  void store(const Key& key, std::shared_ptr<const HistoryFold<SummaryRow>> fold) {
+  // Keeps value as key's, unless a value of later history is kept already (two queries may
+  // derive at once).
+  void store(const Key& key, std::shared_ptr<const Value> value) {
     fw::MutexLock lock(mutex_);
-    if (fold_ == nullptr || key_.generation <= key.generation) {
+    if (value_ == nullptr || key_.generation <= key.generation) {
       key_ = key;
-      fold_ = std::move(fold);
+      value_ = std::move(value);
     }
   }
-  // Lets go of the fold (its memory), as at a rollover, which makes it stale anyway.
+  // Lets go of the value (its memory), as at a rollover, which makes it stale anyway.
   void clear() {
     fw::MutexLock lock(mutex_);
-    fold_.reset();
+    value_.reset();
   }
 
  private:
   fw::Mutex mutex_;
   Key key_ GUARDED_BY(mutex_);
-  std::shared_ptr<const HistoryFold<SummaryRow>> fold_ GUARDED_BY(mutex_);
+  std::shared_ptr<const Value> value_ GUARDED_BY(mutex_);
 };
+
+template <class SummaryRow>
+using SummaryFoldCache = HistoryCache<HistoryFold<SummaryRow>>;
 
 // The analyzer's cache of each summary's history fold.
 struct SummaryFolds {
 #define Q7_SUMMARY_FOLD(name, Row, keys, overTime) SummaryFoldCache<Row> name;
   Q7_ANALYZER_TABLES(Q7_NO_OVER_TIME, Q7_SUMMARY_FOLD, Q7_NO_CURRENT, Q7_NO_INSTANCE)
 #undef Q7_SUMMARY_FOLD
+  // The latency books of the summary period's saved intervals, merged.
+  HistoryCache<LatencyBook> latency;
 
   void clear() {
+    latency.clear();
 #define Q7_CLEAR_SUMMARY_FOLD(name, Row, keys, overTime) name.clear();
     Q7_ANALYZER_TABLES(Q7_NO_OVER_TIME, Q7_CLEAR_SUMMARY_FOLD, Q7_NO_CURRENT, Q7_NO_INSTANCE)
 #undef Q7_CLEAR_SUMMARY_FOLD

@@ -18,10 +18,6 @@
 
 namespace {
 
-long IntervalSeconds() {
-  return static_cast<long>(CConfig::getOverTimeInterval()) * 60;
-}
-
 // History rows to load: the count capped at MAX_ROWS, with the trace when it is cut.
 size_t Capped(size_t rows) {
   if (rows > static_cast<size_t>(MAX_ROWS)) {
@@ -243,10 +239,9 @@ Layout* CDPXAnalyzer::lockedQuery(Inner inner, int* count) {
 }
 
 template <class SummaryRow>
-typename SummaryRow::LayoutType* CDPXAnalyzer::summaryQuery(const char* stem,
-                                                            SummaryFoldCache<SummaryRow>& folds,
-                                                            const char* where, int sampleType,
-                                                            int* count, size_t limit) {
+typename SummaryRow::LayoutType* CDPXAnalyzer::summaryQuery(
+    const char* stem, HistoryCache<HistoryFold<SummaryRow>>& folds, const char* where,
+    int sampleType, int* count, size_t limit) {
   using Layout = typename SummaryRow::LayoutType;
   using OverTimeLayout = typename SummaryRow::OverTimeLayoutType;
   using OverTime = OverTimeOf<OverTimeLayout>;
@@ -266,8 +261,8 @@ typename SummaryRow::LayoutType* CDPXAnalyzer::summaryQuery(const char* stem,
     CvelMutexLock lock(treeMutex);
     cache->flush();
     current.take(cache->currentIntervalTrees().tree(OverTime::kTree), limit);
-    const HistoryWindow window{*history, getCurrentOverTimeInterval(), IntervalSeconds(),
-                               summaryIntervals()};
+    const HistoryWindow window{*history, getCurrentOverTimeInterval(),
+                               CConfig::getOverTimeIntervalSeconds(), summaryIntervals()};
     // The generation is read before the files: a change after it makes the next query refold.
     key = {window.interval - window.length, window.length, window.intervals,
            history::HistoryStore::generation()};
@@ -316,9 +311,10 @@ typename SummaryRow::LayoutType* CDPXAnalyzer::summaryQuery(const char* stem,
   }
 
 // The window of history the queries read.
-#define Q7_HISTORY_WINDOW                                                         \
-  HistoryWindow {                                                                 \
-    *history, getCurrentOverTimeInterval(), IntervalSeconds(), summaryIntervals() \
+#define Q7_HISTORY_WINDOW                                                          \
+  HistoryWindow {                                                                  \
+    *history, getCurrentOverTimeInterval(), CConfig::getOverTimeIntervalSeconds(), \
+        summaryIntervals()                                                         \
   }
 // An over-time table: its tree and row class; a summary: its row class, folded from the
 // current rows of its over-time table and that table's history; instance rows from the

@@ -7,6 +7,7 @@
 
 #include <cstring>
 #include <memory>
+#include <string_view>
 
 #include "core/analyzer/analysis/instance_rows.h"
 #include "core/analyzer/dpx_analyzer.h"
@@ -25,14 +26,20 @@ constexpr int kAggByApplication = 1;
 constexpr int kAggByClient = 2;
 constexpr int kAggByTransaction = 4;
 
+// A name field's text, up to its NUL or its width as the rows keep it.
+std::string_view FieldText(const char* field) {
+  return {field, strnlen(field, kTransactionNameWidth)};
+}
+
 // Finds the row of Row with w's key in table (through the trees' index, without building a
 // lookup row), or adds a new one starting at the transaction's interval; then adds w to it.
 template <class Row>
 void UpdateTable(COverTimeTrees& trees, OverTimeTable table, CDPXTransaction& w,
                  const char* refusal) {
   const std::size_t hash = Row::indexHashOf(w);
-  Row* row = static_cast<Row*>(trees.findIf(
-      table, hash, [&w](TreeNode* candidate) { return static_cast<Row*>(candidate)->hasKeyOf(w); }));
+  Row* row = static_cast<Row*>(trees.findIf(table, hash, [&w](TreeNode* candidate) {
+    return static_cast<Row*>(candidate)->hasKeyOf(w);
+  }));
   if (row == nullptr) {
     auto fresh = std::make_unique<Row>(w);
     fresh->reset(w.getTimeRecorded());
@@ -59,6 +66,8 @@ void UpdatePageTables(COverTimeTrees& trees, CDPXTransaction& w) {
                                     "Error adding to CTOT tree!");
   UpdateTable<CClientAppOverTime>(trees, OverTimeTable::kClientApp, w,
                                   "Error adding to CAOT tree!");
+  trees.latency().add(FieldText(w.getApplicationName()), FieldText(w.getTransactionName()),
+                      w.getMinThreshold(), w.getTotalResponseTime());
 }
 
 // Sets the client field of w whose text is value to its first three address parts, cut to the
@@ -277,6 +286,11 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
           selectTreesFor(w.getTimeRecorded());
           if (page) {
             UpdatePageTables(cache->trees(), w);
+            const int32_t response = w.getTotalResponseTime();
+            requestMetrics->add(
+                FieldText(w.getApplicationName()), FieldText(w.getTransactionName()),
+                {w.getMinThreshold(), response, w.getServerTime(), w.getNetworkTime(),
+                 response - w.getServerTime(), w.isBadStatusCode(), w.getRequestStatus()});
           }
           const int level = instance.level;
           if (level == 1 || (level == 2 && w.isBadStatusCode())) {

@@ -13,10 +13,6 @@
 
 namespace {
 
-long IntervalSeconds() {
-  return static_cast<long>(CConfig::getOverTimeInterval()) * 60;
-}
-
 // A negative running sum is reset to 0. The two numbers traced are the low and high 32-bit
 // halves of the new sum.
 void ClampNegativeSum(int64_t* sum, const char* negativeFormat, const char* resetFormat) {
@@ -76,20 +72,20 @@ void CBaseTable::Update(CDPXTransaction& t) {
                    t.getTotalResponseTime() - t.getServerTime(), t.getServerTime(),
                    t.getNetworkTime(), t);
   updateDPXData(t, kindData.dpx, commonData.totreq);
-  lastTimeOccurred = fw::Now() - (fw::Now() % IntervalSeconds());
+  lastTimeOccurred = fw::Now() - (fw::Now() % CConfig::getOverTimeIntervalSeconds());
 }
 
 void CBaseTable::Update(CARMTransaction& t) {
   updateCommonData(commonData, t.failed, 0, t.responseTime, t.responseTime - t.serverTime,
                    t.serverTime, 0, t);
   updateARMData(t, kindData.arm, commonData.totreq);
-  lastTimeOccurred = fw::Now() - (fw::Now() % IntervalSeconds());
+  lastTimeOccurred = fw::Now() - (fw::Now() % CConfig::getOverTimeIntervalSeconds());
 }
 
 void CBaseTable::Update(CLYNTransaction& t) {
   updateCommonData(commonData, t.failed, 0, t.responseTime, t.responseTime, 0, 0, t);
   updateLYNData(t, kindData.lyn, commonData.totreq);
-  lastTimeOccurred = fw::Now() - (fw::Now() % IntervalSeconds());
+  lastTimeOccurred = fw::Now() - (fw::Now() % CConfig::getOverTimeIntervalSeconds());
 }
 
 void CBaseTable::updateCommonData(common_data_t& row, bool failed, long /*timeRecorded*/,
@@ -133,7 +129,7 @@ void CBaseTable::reset(long now) {
   const int32_t kept = keptWord;
   commonData = common_data_t{};
   memset(&kindData, 0, sizeof(kindData));
-  commonData.dintval = static_cast<int32_t>(IntervalSeconds());
+  commonData.dintval = static_cast<int32_t>(CConfig::getOverTimeIntervalSeconds());
   commonData.mtrthres = threshold;
   keptWord = kept;
   TimeSince70ToMordel(now - (now % commonData.dintval), timestamp);
