@@ -183,6 +183,8 @@ void ResetRuntimeForTesting() {
     State().uname = nullptr;
     State().health_provider = nullptr;
     State().info_provider = nullptr;
+    State().latency_provider = nullptr;
+    State().metrics_provider = nullptr;
   }
   MutexLock lock(State().shutdown_mutex);
   State().shutdown_requested = false;

@@ -14,8 +14,9 @@
 
 #include "framework/agent_runtime.h"
 #include "framework/api_token.h"
-#include "framework/http_json.h"
 #include "framework/events_api.h"
+#include "framework/http_json.h"
+#include "framework/metrics_api.h"
 #include "framework/mutex.h"
 #include "framework/runtime_state.h"
 #include "framework/sample_query.h"
@@ -163,7 +164,7 @@ void ServeSample(const httplib::Request& req, httplib::Response& res) {
 
 }  // namespace
 
-HttpServer::HttpServer() : server_(std::make_unique<httplib::Server>()) {}
+HttpServer::HttpServer() = default;
 
 HttpServer::~HttpServer() {
   Stop();
@@ -247,6 +248,7 @@ void HttpServer::InstallRoutes(bool loopback) {
   s.Get(R"(/api/v1/tables/([A-Za-z0-9_]+))", ServeSample);
   InstallSituationRoutes(s);
   InstallEventRoutes(s);
+  InstallMetricsRoutes(s);
 }
 
 int HttpServer::Start(const std::string& address, std::string* error) {
@@ -260,6 +262,17 @@ int HttpServer::Start(const std::string& address, std::string* error) {
     *error = "\"" + address + "\" is not an address of the form host:port";
     return kInvalidArgument;
   }
+  if (tls()) {
+    auto secure = std::make_unique<httplib::SSLServer>(tls_certificate_.c_str(), tls_key_.c_str());
+    if (!secure->is_valid()) {
+      *error = "cannot load the TLS certificate " + tls_certificate_ + " and key " + tls_key_ +
+               " (PEM files, the key matching the certificate)";
+      return kInvalidArgument;
+    }
+    server_ = std::move(secure);
+  } else {
+    server_ = std::make_unique<httplib::Server>();
+  }
   InstallRoutes(IsLoopbackHost(host));
   if (port == 0) {
     port = server_->bind_to_any_port(host.c_str());
@@ -271,8 +284,9 @@ int HttpServer::Start(const std::string& address, std::string* error) {
     *error = "cannot bind " + address + ": " + std::strerror(errno);
     return kIoError;
   }
-  bound_address_ =
-      (host.find(':') != std::string::npos ? "[" + host + "]" : host) + ":" + std::to_string(port);
+  bound_address_ = std::string(tls() ? "https://" : "") +
+                   (host.find(':') != std::string::npos ? "[" + host + "]" : host) + ":" +
+                   std::to_string(port);
   thread_ = std::thread([this] {
     SetThreadName("HTTP Server");
     server_->listen_after_bind();

@@ -33,10 +33,18 @@ class HttpServer {
   // request that needs it is allowed. Call before Start.
   void SetApiToken(std::string token) { api_token_ = std::move(token); }
 
+  // Serves HTTPS with the PEM certificate (chain) and private key files at these paths. Call
+  // before Start; Start fails when they do not load.
+  void UseTls(std::string certificate, std::string key) {
+    tls_certificate_ = std::move(certificate);
+    tls_key_ = std::move(key);
+  }
+  bool tls() const { return !tls_certificate_.empty(); }
+
   // Stops serving and waits for requests in flight. Safe to call when not started.
   void Stop();
 
-  // "host:port" as bound, empty before Start succeeded.
+  // "host:port" as bound ("https://host:port" with TLS), empty before Start succeeded.
   const std::string& bound_address() const { return bound_address_; }
 
   // Splits "host:port"; returns false when it does not parse.
@@ -45,10 +53,12 @@ class HttpServer {
  private:
   void InstallRoutes(bool loopback);
 
-  std::unique_ptr<httplib::Server> server_;
+  std::unique_ptr<httplib::Server> server_;  // made by Start: plain or TLS
   std::thread thread_;
   std::string bound_address_;
   std::string api_token_;  // set before Start, then read by the pool threads
+  std::string tls_certificate_;
+  std::string tls_key_;
 };
 
 }  // namespace fw

@@ -42,6 +42,20 @@ std::string AddressFilePath() {
   return logs + "q7agent.addr";
 }
 
+// An API others can reach over plain HTTP gives away the token with every change it accepts.
+void WarnIfPlainOffLoopback(const fw::HttpServer& server, const std::string& address) {
+  std::string host;
+  int port = 0;
+  if (!server.tls() && fw::HttpServer::ParseAddress(address, &host, &port) &&
+      !fw::IsLoopbackHost(host)) {
+    fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__,
+                          "Warning: the HTTP API on %s is reachable from other hosts over plain "
+                          "HTTP: the bearer token and every reply travel in clear. Set "
+                          "Q7_TLS_CERT and Q7_TLS_KEY to serve HTTPS.",
+                          server.bound_address().c_str());
+  }
+}
+
 }  // namespace
 
 int kunmain(int /*argc*/, char** /*argv*/) {
@@ -83,17 +97,33 @@ int kunmain(int /*argc*/, char** /*argv*/) {
   fw::HttpServer server;
   server.SetApiToken(token);
   std::string address_file;
-  if (server.Start(address, &error) == fw::kOk) {
-    Q7_TRACE(kUnit, fw::kTraceSummary, "HTTP API listening on %s", server.bound_address().c_str());
-    address_file = AddressFilePath();
-    if (!address_file.empty()) {
-      WriteAddressFile(address_file, server.bound_address());
-    }
-  } else {
-    // The agent still collects and keeps history without its API; say so loudly.
+  std::string certificate;
+  std::string key;
+  const bool hasCertificate = fw::GetEnv("Q7_TLS_CERT", &certificate) && !certificate.empty();
+  const bool hasKey = fw::GetEnv("Q7_TLS_KEY", &key) && !key.empty();
+  if (hasCertificate != hasKey) {
+    // Never fall back to plain HTTP when TLS was asked for: the token would travel in clear.
     fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__,
-                          "HTTP API not started (Q7_HTTP_ADDRESS=%s): %s", address.c_str(),
-                          error.c_str());
+                          "HTTP API not started: Q7_TLS_CERT and Q7_TLS_KEY must be set "
+                          "together (certificate and private key, PEM)");
+  } else {
+    if (hasCertificate) {
+      server.UseTls(certificate, key);
+    }
+    if (server.Start(address, &error) == fw::kOk) {
+      Q7_TRACE(kUnit, fw::kTraceSummary, "HTTP API listening on %s",
+               server.bound_address().c_str());
+      WarnIfPlainOffLoopback(server, address);
+      address_file = AddressFilePath();
+      if (!address_file.empty()) {
+        WriteAddressFile(address_file, server.bound_address());
+      }
+    } else {
+      // The agent still collects and keeps history without its API; say so loudly.
+      fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__,
+                            "HTTP API not started (Q7_HTTP_ADDRESS=%s): %s", address.c_str(),
+                            error.c_str());
+    }
   }
 
   {

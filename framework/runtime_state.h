@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "framework/agent_runtime.h"
+#include "framework/metrics_api.h"
 #include "framework/mutex.h"
 
 namespace fw {
@@ -27,6 +28,8 @@ struct RuntimeState {
   std::function<int(struct utsname*)> uname GUARDED_BY(mutex);
   std::function<void(nlohmann::json&)> health_provider GUARDED_BY(mutex);
   std::function<void(nlohmann::json&)> info_provider GUARDED_BY(mutex);
+  LatencyProvider latency_provider GUARDED_BY(mutex);
+  MetricsProvider metrics_provider GUARDED_BY(mutex);
 
   // The shutdown request; shutdown_cv wakes the main loop.
   Mutex shutdown_mutex;

@@ -1,5 +1,8 @@
 #include "tama/agent.h"
 
+#include <sys/stat.h>
+
+#include <algorithm>
 #include <cstdlib>
 #include <nlohmann/json.hpp>
 #include <string>
@@ -41,6 +44,8 @@ Agent::~Agent() {
   // The providers capture this agent; none may outlive it.
   fw::SetAgentInfoProvider({});
   fw::SetHealthProvider({});
+  fw::SetLatencyProvider({});
+  fw::SetMetricsProvider({});
 }
 
 int Agent::run(int argc, char** argv) {
@@ -91,12 +96,18 @@ int Agent::run(int argc, char** argv) {
     collectorMonitor->start();
     Q7_TRACE(kUnit, fw::kTraceDetail, "Started unix DPX Collector monitor");
     setCollectorState("supervised");
+    fw::MutexLock lock(mutex_);
+    monitors_ = {{"writer", analyzerMonitor.get()}, {"capture", collectorMonitor.get()}};
   }
 
   parts_.send_agent_message("RT_AGENT_STARTED", 4, {});
 
   const int result = kunmain(argc, argv);
 
+  {
+    fw::MutexLock lock(mutex_);
+    monitors_.clear();
+  }
   stopMonitor(analyzerMonitor, "Stopped DPX Analyzer monitor");
   stopMonitor(collectorMonitor, "Stopped DPX Collector monitor");
 
@@ -127,6 +138,8 @@ void Agent::prepare_startup(int /*argc*/, char** /*argv*/) {
 
   fw::SetAgentInfoProvider([this](nlohmann::json& info) { describeAgent(info); });
   fw::SetHealthProvider([this](nlohmann::json& health) { describeHealth(health); });
+  fw::SetLatencyProvider(parts_.describe_latency);
+  fw::SetMetricsProvider([this](fw::PrometheusText& out) { writeMetrics(out); });
 
   parts_.start_analyzer();
 }
@@ -163,6 +176,67 @@ void Agent::describeHealth(nlohmann::json& health) const {
   health["analyzer"] = analyzer["state"];
   fw::MutexLock lock(mutex_);
   health["collector"] = collectorState_;
+}
+
+void Agent::writeMetrics(fw::PrometheusText& out) const {
+  nlohmann::json analyzer;
+  parts_.describe_analyzer(analyzer);
+  const nlohmann::json& counters = analyzer["counters"];
+  const auto number = [&counters](const char* name) {
+    const auto found = counters.find(name);
+    return found != counters.end() && found->is_number() ? found->get<double>() : 0.0;
+  };
+  struct Family {
+    const char* name;
+    const char* type;
+    const char* help;
+    const char* counter;
+  };
+  for (const Family& f : {
+           Family{"q7_records_read_total", "counter", "Records read from the collector's files.",
+                  "records_read"},
+           Family{"q7_records_unparsed_total", "counter",
+                  "Records read that are not a transaction.", "records_unparsed"},
+           Family{"q7_outliers_dropped_total", "counter",
+                  "Transactions dropped as over the outlier limit.", "outliers_dropped"},
+           Family{"q7_transactions_processed_total", "counter",
+                  "Transactions counted into the tables.", "transactions_processed"},
+           Family{"q7_transactions_ignored_total", "counter",
+                  "Transactions no pattern matched, or the collector did not sample.",
+                  "transactions_ignored"},
+           Family{"q7_queue_depth", "gauge", "Transactions waiting for the analyzer.",
+                  "queue_depth"},
+           Family{"q7_checkpoints_written_total", "counter", "Checkpoints written.",
+                  "checkpoints_written"},
+       }) {
+    out.family(f.name, f.type, f.help);
+    out.sample(f.name, {}, number(f.counter));
+  }
+  // How far reading trails the end of the file being read.
+  double behind = 0;
+  if (const auto file = counters.find("file"); file != counters.end() && file->is_string()) {
+    struct stat st {};
+    if (!file->get<std::string>().empty() && ::stat(file->get<std::string>().c_str(), &st) == 0) {
+      behind = std::max(0.0, static_cast<double>(st.st_size) - number("offset"));
+    }
+  }
+  out.family("q7_intake_lag_bytes", "gauge",
+             "Bytes of the collector's file being read that are not read yet.");
+  out.sample("q7_intake_lag_bytes", {}, behind);
+  out.family("q7_collector_restarts_total", "counter",
+             "Times a supervised collector process was started again after its first start.");
+  {
+    fw::MutexLock lock(mutex_);
+    for (const auto& [process, monitor] : monitors_) {
+      out.sample("q7_collector_restarts_total", {{"process", process}},
+                 static_cast<double>(std::max(0L, monitor->starts() - 1)));
+    }
+  }
+  out.family("q7_agent_info", "gauge", "The agent's identity; always 1.");
+  out.sample("q7_agent_info", {{"agent", kq1_agent_name}, {"version", kq1_product_ver}}, 1);
+  if (parts_.write_analyzer_metrics) {
+    parts_.write_analyzer_metrics(out);
+  }
 }
 
 void Agent::setCollectorState(const char* state) {

@@ -17,6 +17,7 @@
 #include <string>
 #include <vector>
 
+#include "framework/metrics_api.h"
 #include "framework/mutex.h"
 #include "tama/collector_monitor.h"
 
@@ -35,6 +36,12 @@ struct AgentParts {
   // transactions processed, ignored and taken from the queue, queue depth, the file and offset
   // being read).
   std::function<void(nlohmann::json& out)> describe_analyzer;
+  // Percentiles and apdex per application or transaction over a window, for /api/v1/latency;
+  // none before the analyzer starts.
+  fw::LatencyProvider describe_latency;
+  // The analyzer's own /metrics families: the page requests per application and transaction
+  // and the history writes; none before the analyzer starts.
+  fw::MetricsProvider write_analyzer_metrics;
   // Creates a collector process monitor (not yet started).
   std::function<std::unique_ptr<CollectorMonitor>(const CollectorMonitorSpec&)>
       make_collector_monitor;
@@ -69,12 +76,16 @@ class Agent {
  private:
   void describeAgent(nlohmann::json& info) const;
   void describeHealth(nlohmann::json& health) const;
+  // /metrics: the agent's health (intake, queue, collectors) and the analyzer's families.
+  void writeMetrics(fw::PrometheusText& out) const;
   void setCollectorState(const char* state);
 
   const AgentParts parts_;
   mutable fw::Mutex mutex_;
   // What /healthz says of collector supervision.
   std::string collectorState_ GUARDED_BY(mutex_) = "not supervised";
+  // The supervised processes, by the name /metrics gives them, while supervised.
+  std::vector<std::pair<std::string, const CollectorMonitor*>> monitors_ GUARDED_BY(mutex_);
 };
 
 }  // namespace tama

@@ -3,7 +3,7 @@
 // A supervised collector process as the agent sees it: started before the framework's main
 // loop and stopped after it. ServiceMonitor is the process's kind; tests use fakes.
 //
-// Thread safety: start and stop from the thread that owns the monitor.
+// Thread safety: start and stop from the thread that owns the monitor; starts from any thread.
 
 #include <string>
 #include <vector>
@@ -19,6 +19,8 @@ class CollectorMonitor {
   // Stops supervising and waits for the supervision thread; that thread runs the stop command
   // when the process is still alive.
   virtual int stop() = 0;
+  // Times the process has been started so far; any thread.
+  virtual long starts() const = 0;
 };
 
 // What a collector monitor is created with.

@@ -1,7 +1,10 @@
+#include <algorithm>
 #include <cstddef>
 #include <nlohmann/json.hpp>
+#include <tuple>
 
 #include "core/analyzer/dpx_analyzer.h"
+#include "core/history/history_store.h"
 #include "core/messages/agent_message.h"
 #include "q7tema/pattern_tables.h"
 #include "q7tema/row_query.h"
@@ -109,6 +112,50 @@ void describeAnalyzer(nlohmann::json& out) {
                      {"offset", intake.offset}};
 }
 
+// Each key of a book as a row of the latency API, by application then transaction.
+std::vector<fw::LatencyRow> latencyRows(const fw::LatencyQuery& query) {
+  std::vector<fw::LatencyRow> rows;
+  CDPXAnalyzer* const analyzer = CDPXAnalyzer::GetInstanceIfStarted();
+  if (analyzer == nullptr) {
+    return rows;
+  }
+  const LatencyBook book = analyzer->getLatency(query.summary);
+  const LatencyBook::Entries& entries =
+      query.by_transaction ? book.transactions() : book.applications();
+  rows.reserve(entries.size());
+  for (const auto& [key, entry] : entries) {
+    fw::LatencyRow row;
+    const auto [application, transaction] = LatencyBook::splitKey(key);
+    row.application = application;
+    row.transaction = transaction;
+    const LatencySketch& sketch = entry.sketch;
+    row.requests = sketch.count();
+    row.p50_ms = sketch.quantile(0.50);
+    row.p90_ms = sketch.quantile(0.90);
+    row.p95_ms = sketch.quantile(0.95);
+    row.p99_ms = sketch.quantile(0.99);
+    row.max_ms = sketch.max();
+    row.apdex = entry.apdex();
+    row.threshold_ms = entry.thresholdMillis;
+    rows.push_back(std::move(row));
+  }
+  std::sort(rows.begin(), rows.end(), [](const fw::LatencyRow& a, const fw::LatencyRow& b) {
+    return std::tie(a.application, a.transaction) < std::tie(b.application, b.transaction);
+  });
+  return rows;
+}
+
+void writeAnalyzerMetrics(fw::PrometheusText& out) {
+  CDPXAnalyzer* const analyzer = CDPXAnalyzer::GetInstanceIfStarted();
+  if (analyzer == nullptr) {
+    return;
+  }
+  analyzer->getRequestMetrics().write(out);
+  out.family("q7_history_write_seconds_total", "counter",
+             "Time spent writing the over-time history files.");
+  out.sample("q7_history_write_seconds_total", {}, history::HistoryStore::writeSeconds());
+}
+
 }  // namespace
 
 AgentParts ProcessParts() {
@@ -119,6 +166,8 @@ AgentParts ProcessParts() {
   parts.shutdown_analyzer = [] { CDPXAnalyzer::GetInstanceNoStart()->Shutdown(); };
   parts.join_analyzer = [] { CDPXAnalyzer::GetInstanceNoStart()->Join(); };
   parts.describe_analyzer = &describeAnalyzer;
+  parts.describe_latency = &latencyRows;
+  parts.write_analyzer_metrics = &writeAnalyzerMetrics;
   parts.make_collector_monitor = &makeServiceMonitor;
   parts.send_agent_message = [](const char* key, int severity,
                                 const std::vector<std::string>& args) {

@@ -109,6 +109,7 @@ void ServiceMonitor::run() {
       continue;
     }
     Q7_TRACE(kUnit, fw::kTraceError, "Starting process with command %s", startPath);
+    ++starts;
     runCommand(startPath, startArgv);
     wait();
   }
@@ -147,6 +148,7 @@ class ServiceMonitorAdapter : public CollectorMonitor {
     monitor.stopMonitoring();
     return 0;
   }
+  long starts() const override { return monitor.startsDone(); }
 
  private:
   static std::vector<char*> Vector(std::vector<std::string>& texts) {

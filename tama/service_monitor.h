@@ -42,6 +42,8 @@ class ServiceMonitor {
   long getPID() const;
   // Polls done so far, each now followed by its pause; from any thread (tests wait on it).
   long pollsDone() const { return polls.load(); }
+  // Start commands run so far; from any thread (/metrics reports the restarts).
+  long startsDone() const { return starts.load(); }
 
  private:
   static void* ServiceMonitorTask(void* self);
@@ -58,6 +60,7 @@ class ServiceMonitor {
   const long interval;                // seconds
   std::atomic<bool> running{false};   // set by startMonitoring, cleared by stopMonitoring
   std::atomic<long> polls{0};         // counted by the monitor thread as each pause begins
+  std::atomic<long> starts{0};        // counted by the monitor thread before each start command
   pthread_t thread{};                 // valid once started
   bool started = false;               // owner's thread only
   std::unique_ptr<CvelEvent> wakeUp;  // manual-reset, not signalled at first

@@ -78,6 +78,12 @@ void applyAgentProperties() {
     CConfig::setCheckpointSeconds(*end == '\0' && seconds <= 86400 ? static_cast<int>(seconds)
                                                                    : -1);
   }
+  if (const std::string series = AgentProperties::getAgentProperty("KQ7METRICSMAXSERIES");
+      !series.empty()) {
+    char* end = nullptr;
+    const long n = std::strtol(series.c_str(), &end, 10);
+    CConfig::setMetricsMaxSeries(*end == '\0' && n <= 1000000 ? static_cast<int>(n) : -1);
+  }
 }
 
 int LoadAgents() {

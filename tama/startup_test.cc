@@ -113,6 +113,7 @@ class FakeMonitor : public tama::CollectorMonitor {
     g_events.push_back("stop " + which_);
     return 0;
   }
+  long starts() const override { return 1; }
 
  private:
   std::string which_;
@@ -133,6 +134,8 @@ tama::AgentParts FakeParts() {
   parts.shutdown_analyzer = [] { g_events.push_back("analyzer shutdown"); };
   parts.join_analyzer = [] { g_events.push_back("analyzer join"); };
   parts.describe_analyzer = [](nlohmann::json& out) { out["state"] = "running"; };
+  parts.describe_latency = [](const fw::LatencyQuery&) { return std::vector<fw::LatencyRow>{}; };
+  parts.write_analyzer_metrics = [](fw::PrometheusText&) {};
   parts.send_agent_message = [](const char* key, int severity, const std::vector<std::string>&) {
     g_events.push_back(std::string("message ") + key + " " + std::to_string(severity));
     fw::RequestShutdown(1);  // leave the main loop at once

@@ -124,6 +124,15 @@ std::string SampleTarget(const std::string& table, const std::vector<std::string
   return target;
 }
 
+std::string LatencyTarget(const std::string& by, const std::string& window,
+                          const std::vector<std::string>& wheres) {
+  std::string target = "/api/v1/latency?by=" + UrlEncode(by) + "&window=" + UrlEncode(window);
+  for (const std::string& where : wheres) {
+    target += "&where=" + UrlEncode(where);
+  }
+  return target;
+}
+
 std::string SituationTarget(const std::string& name) {
   return "/api/v1/situations/" + UrlEncode(name);
 }
@@ -184,12 +193,15 @@ std::vector<std::string> SseParser::Feed(const std::string& chunk) {
   return events;
 }
 
-ApiClient::ApiClient(const std::string& url, std::string token)
+ApiClient::ApiClient(const std::string& url, std::string token, const std::string& ca_certificate)
     : url_(url), token_(std::move(token)) {
   if (!IsAgentUrl(url_)) {
     return;  // every call reports the bad URL
   }
   http_ = std::make_unique<httplib::Client>(url_);
+  if (!ca_certificate.empty()) {
+    http_->set_ca_cert_path(ca_certificate.c_str());
+  }
   http_->set_connection_timeout(kConnectTimeoutSeconds);
   http_->set_read_timeout(kReadTimeoutSeconds);
   if (!token_.empty()) {

@@ -44,6 +44,10 @@ std::string UrlEncode(const std::string& text);
 std::string SampleTarget(const std::string& table, const std::vector<std::string>& wheres,
                          std::optional<long> limit);
 
+// GET target of the latency figures: "/api/v1/latency?by=BY&window=WINDOW&where=...".
+std::string LatencyTarget(const std::string& by, const std::string& window,
+                          const std::vector<std::string>& wheres);
+
 // Target of one situation: "/api/v1/situations/NAME".
 std::string SituationTarget(const std::string& name);
 
@@ -73,9 +77,11 @@ class SseParser {
 // A client of one agent.
 class ApiClient {
  public:
-  // url: "http://host:port" (https works too). When token is not empty it is sent as
-  // "Authorization: Bearer <token>" on every request.
-  ApiClient(const std::string& url, std::string token);
+  // url: "http://host:port" or "https://host:port". When token is not empty it is sent as
+  // "Authorization: Bearer <token>" on every request. ca_certificate: the PEM file that HTTPS
+  // verifies the agent's certificate against (empty: the system's CAs); the host name or
+  // address must match the certificate either way.
+  ApiClient(const std::string& url, std::string token, const std::string& ca_certificate = "");
   ~ApiClient();
 
   ApiClient(const ApiClient&) = delete;

@@ -173,14 +173,30 @@ std::string AddressToUrl(const std::string& address) {
   return url;
 }
 
+std::string AgentSetting(const Environment& env, const std::string& name) {
+  std::optional<std::string> value = env.get(name);
+  const std::string config_dir = ConfigDirectory(env);
+  if ((!value || value->empty()) && !config_dir.empty()) {
+    value = EnvFileValue(config_dir + "q7.env", name);
+  }
+  return value.value_or("");
+}
+
 bool ResolveConnection(const Environment& env, const std::string& url_override,
-                       const std::string& token_override, Connection* out, std::string* error) {
+                       const std::string& token_override, const std::string& ca_override,
+                       Connection* out, std::string* error) {
   std::string address = url_override;
   if (address.empty() && !ResolveAddress(env, &address, error)) {
     return false;
   }
+  // An agent given a certificate serves only HTTPS; a configured address has no scheme.
+  if (url_override.empty() && address.find("://") == std::string::npos &&
+      !AgentSetting(env, "Q7_TLS_CERT").empty()) {
+    address = "https://" + address;
+  }
   out->url = AddressToUrl(address);
   out->token = token_override.empty() ? ResolveToken(env) : token_override;
+  out->ca_certificate = ca_override.empty() ? AgentSetting(env, "Q7_TLS_CACERT") : ca_override;
   return true;
 }
 

@@ -11,6 +11,9 @@
 //                else 127.0.0.1:7420. A configured port 0 means "the agent picked one", so the
 //                .addr file wins over it.
 //   token      = <configdir>q7_api_token, trimmed; none when the file is missing or empty.
+//   scheme     = https when the agent has a certificate (Q7_TLS_CERT, from the environment or
+//                q7.env) and the address names no scheme; the .addr file names it.
+//   CA         = --cacert, else Q7_TLS_CACERT (environment or q7.env), else the system's.
 //
 // Everything the lookup reads from the process is behind Environment, so tests can run it
 // against a temporary home without touching the real environment.
@@ -36,7 +39,13 @@ struct Environment {
 struct Connection {
   std::string url;    // "http://host:port", no trailing '/'
   std::string token;  // empty: send no Authorization header
+  // PEM file of the CA (or the self-signed certificate) that signs the agent's certificate;
+  // empty: the system's trusted CAs.
+  std::string ca_certificate;
 };
+
+// NAME from the process environment, else from <configdir>q7.env; empty when in neither.
+std::string AgentSetting(const Environment& env, const std::string& name);
 
 // Home and configuration directories, each with a trailing '/'; empty when the home cannot be
 // determined (no Q7_HOME and no executable path).
@@ -59,8 +68,10 @@ std::string ResolveToken(const Environment& env);
 // an agent listening everywhere is reached locally through it.
 std::string AddressToUrl(const std::string& address);
 
-// The whole connection: url_override and token_override, when not empty, win over the lookup.
+// The whole connection: url_override, token_override and ca_override, when not empty, win over
+// the lookup.
 bool ResolveConnection(const Environment& env, const std::string& url_override,
-                       const std::string& token_override, Connection* out, std::string* error);
+                       const std::string& token_override, const std::string& ca_override,
+                       Connection* out, std::string* error);
 
 }  // namespace q7ctl

@@ -84,12 +84,33 @@ TEST_F(ConfigTest, TokenFromTheConfigDirectory) {
 
   Connection connection;
   std::string error;
-  ASSERT_TRUE(ResolveConnection(env_, "", "", &connection, &error));
+  ASSERT_TRUE(ResolveConnection(env_, "", "", "", &connection, &error));
   EXPECT_EQ("http://127.0.0.1:7420", connection.url);
   EXPECT_EQ("s3cr3t", connection.token);
-  ASSERT_TRUE(ResolveConnection(env_, "http://h:1/", "other", &connection, &error));
+  EXPECT_EQ("", connection.ca_certificate);
+  ASSERT_TRUE(ResolveConnection(env_, "http://h:1/", "other", "", &connection, &error));
   EXPECT_EQ("http://h:1", connection.url);
   EXPECT_EQ("other", connection.token);
+}
+
+// An agent with a certificate is reached over HTTPS, checked against the configured CA unless
+// --cacert names another; an address with its own scheme or --url keeps it.
+TEST_F(ConfigTest, AgentWithACertificateIsReachedOverHttps) {
+  scratch_.write("config/q7.env",
+                 "Q7_HTTP_ADDRESS=10.0.0.5:7443\nQ7_TLS_CERT=/etc/q7/agent.pem\n"
+                 "Q7_TLS_CACERT=/etc/q7/ca.pem\n");
+  Connection connection;
+  std::string error;
+  ASSERT_TRUE(ResolveConnection(env_, "", "", "", &connection, &error));
+  EXPECT_EQ("https://10.0.0.5:7443", connection.url);
+  EXPECT_EQ("/etc/q7/ca.pem", connection.ca_certificate);
+  ASSERT_TRUE(ResolveConnection(env_, "", "", "/tmp/other.pem", &connection, &error));
+  EXPECT_EQ("/tmp/other.pem", connection.ca_certificate);
+  ASSERT_TRUE(ResolveConnection(env_, "http://h:1", "", "", &connection, &error));
+  EXPECT_EQ("http://h:1", connection.url);
+  vars_["Q7_TLS_CERT"] = "";  // empty in the environment: the file's setting still holds
+  ASSERT_TRUE(ResolveConnection(env_, "", "", "", &connection, &error));
+  EXPECT_EQ("https://10.0.0.5:7443", connection.url);
 }
 
 // An address becomes a URL; an agent listening everywhere is reached on loopback.

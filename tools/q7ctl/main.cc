@@ -20,12 +20,14 @@ constexpr int kUsage = 2;
 constexpr char kMainFooter[] =
     R"(Connection (unless --url and --token are given), as the agent itself looks it up:
   address  Q7_HTTP_ADDRESS from the environment, else from <configdir>q7.env, else the address
-           the agent wrote to <home>logs/q7agent.addr, else 127.0.0.1:7420
+           the agent wrote to <home>logs/q7agent.addr, else 127.0.0.1:7420; https when the
+           agent has a certificate (Q7_TLS_CERT), checked against --cacert or Q7_TLS_CACERT
   token    <configdir>q7_api_token, sent as "Authorization: Bearer <token>"
   home = $Q7_HOME or the parent of q7ctl's bin/; configdir = $Q7_CONFIG_DIR or <home>config/
 Examples:
   q7ctl tables
   q7ctl sample Q7TXSM --where "APPLICATIN EQ Shop" -o csv
+  q7ctl latency --by transaction
   q7ctl situation start Shop --table Q7TXPTNS APPLICATIN=Shop APPPATTERN='*' \
         TRANSACTN=Checkout TRANSPATTN='*/checkout*'
   q7ctl events --follow
@@ -35,6 +37,7 @@ Exit status: 0 done, 1 the agent failed or could not be reached, 2 bad command l
 struct Globals {
   std::string url;
   std::string token;
+  std::string cacert;
   std::string output = "table";
   bool wide = false;
 };
@@ -103,6 +106,23 @@ int Sample(ApiClient& client, const FormatOptions& options, const std::string& t
     SayNone(options, "rows");
   }
   WriteRows(rows, options, std::cout);
+  return 0;
+}
+
+int Latency(ApiClient& client, const FormatOptions& options, const std::string& by,
+            const std::string& window, const std::vector<std::string>& wheres) {
+  Json reply, rows;
+  Result result = client.Get(LatencyTarget(by, window, wheres), &reply);
+  if (result.ok()) {
+    result = ArrayField(reply, "rows", &rows);
+  }
+  if (!result.ok()) {
+    return Fail(result);
+  }
+  if (rows.empty()) {
+    SayNone(options, "requests in the window");
+  }
+  WriteRows(rows, options, std::cout, reply);
   return 0;
 }
 
@@ -223,6 +243,9 @@ int Run(int argc, char** argv) {
   Globals globals;
   app.add_option("--url", globals.url, "Agent address, http://host:port (default: looked up)");
   app.add_option("--token", globals.token, "API token (default: <configdir>q7_api_token)");
+  app.add_option("--cacert", globals.cacert,
+                 "HTTPS: PEM file of the CA, or the self-signed certificate, that signed the "
+                 "agent's certificate (default: Q7_TLS_CACERT, else the system's CAs)");
   app.add_option("-o,--output", globals.output, "Output format: table, json or csv")
       ->check(CLI::IsMember({"table", "json", "csv"}))
       ->capture_default_str();
@@ -249,6 +272,32 @@ int Run(int argc, char** argv) {
       "  q7ctl sample Q7AGNTDTS\n"
       "  q7ctl sample Q7TXSM --where \"APPLICATIN EQ Shop\" --where \"TOTREQ GT 10\" --limit 5\n"
       "  q7ctl sample Q7TXSM -o csv > q7txsm.csv"));
+
+  CLI::App* latency = app.add_subcommand(
+      "latency",
+      "Percentiles (p50, p90, p95, p99), maximum and apdex per application or transaction");
+  std::string by = "application";
+  std::string window = "summary";
+  std::vector<std::string> latency_wheres;
+  latency->add_option("--by", by, "Key: application or transaction")
+      ->check(CLI::IsMember({"application", "transaction"}))
+      ->capture_default_str();
+  latency
+      ->add_option("--window", window,
+                   "interval (the current over-time interval) or summary (the summary period, "
+                   "24 hours by default)")
+      ->check(CLI::IsMember({"interval", "summary"}))
+      ->capture_default_str();
+  latency->add_option("--where", latency_wheres,
+                      "Filter \"COLUMN OP VALUE\" on a column of the answer (OP: EQ NE LT LE GT "
+                      "GE); repeat to AND");
+  latency->footer(Help(
+      "Times are in milliseconds, within 1 % of the exact percentile; apdex counts requests\n"
+      "within the threshold T as satisfied and within 4T as tolerating.\n"
+      "Examples:\n"
+      "  q7ctl latency\n"
+      "  q7ctl latency --by transaction --where \"application EQ Shop\" --where \"p95_ms GT 500\"\n"
+      "  q7ctl latency --window interval -o csv"));
 
   CLI::App* situation = app.add_subcommand("situation", "List, start or stop situations");
   situation->require_subcommand(1);
@@ -294,11 +343,12 @@ int Run(int argc, char** argv) {
   options.wide = globals.wide;
   Connection connection;
   std::string error;
-  if (!ResolveConnection(Environment::Process(), globals.url, globals.token, &connection, &error)) {
+  if (!ResolveConnection(Environment::Process(), globals.url, globals.token, globals.cacert,
+                         &connection, &error)) {
     std::cerr << "q7ctl: " << error << '\n';
     return kFailed;
   }
-  ApiClient client(connection.url, connection.token);
+  ApiClient client(connection.url, connection.token, connection.ca_certificate);
 
   if (tables->parsed()) {
     return Tables(client, options);
@@ -306,6 +356,9 @@ int Run(int argc, char** argv) {
   if (sample->parsed()) {
     return Sample(client, options, table, wheres,
                   limit_option->count() > 0 ? std::optional<long>(limit) : std::nullopt);
+  }
+  if (latency->parsed()) {
+    return Latency(client, options, by, window, latency_wheres);
   }
   if (list->parsed()) {
     return SituationList(client, options);
