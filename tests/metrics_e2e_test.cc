@@ -14,6 +14,8 @@
 #include <vector>
 
 #include "tests/agent_fixture.h"
+#include "tests/support/prometheus_server.h"
+#include "tests/support/scratch_dir.h"
 #include "tests/support/sm3_records.h"
 
 namespace q7test {
@@ -224,6 +226,104 @@ TEST_F(MetricsE2ETest, MetricsAreLintCleanAndCountEveryPage) {
   EXPECT_NE(std::string::npos, text.find("le=\"0.8\"")) << "the threshold is a bucket bound";
   EXPECT_NE(std::string::npos, text.find("le=\"3.2\"")) << "and so is four times it";
   EXPECT_NE(std::string::npos, text.find("q7_records_read_total "));
+  stopWith(SIGTERM);
+}
+
+}  // namespace
+}  // namespace q7test
+
+namespace q7test {
+namespace {
+
+// Runs a shell command in dir; its exit code, with its output in *output.
+int Shell(const std::string& dir, const std::string& command, std::string* output) {
+  return runProgram("/bin/sh", {"-c", "cd " + dir + " && " + command}, {}, output);
+}
+
+// With a certificate and key the API speaks HTTPS only: q7ctl reads it given the CA (and not
+// without), Prometheus scrapes it with tls_config, and plain HTTP gets no answer.
+TEST_F(AgentE2ETest, ServesHttpsOnlyWithACertificate) {
+  const std::string tls = home_.path() + "tls";
+  std::filesystem::create_directories(tls);
+  std::string output;
+  // A throw-away CA, and the agent's certificate for 127.0.0.1 signed by it.
+  ASSERT_EQ(0, Shell(tls,
+                     "openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes "
+                     "-keyout ca.key -out ca.pem -days 2 -subj /CN=q7-test-ca 2>&1 && "
+                     "openssl req -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes "
+                     "-keyout agent.key -out agent.csr -subj /CN=127.0.0.1 2>&1 && "
+                     "printf 'subjectAltName=IP:127.0.0.1\\n' > san.ext && "
+                     "openssl x509 -req -in agent.csr -CA ca.pem -CAkey ca.key -CAcreateserial "
+                     "-out agent.pem -days 2 -extfile san.ext 2>&1",
+                     &output))
+      << output;
+  extraEnv_["Q7_TLS_CERT"] = tls + "/agent.pem";
+  extraEnv_["Q7_TLS_KEY"] = tls + "/agent.key";
+  const std::string address = start();
+  ASSERT_EQ(0u, address.rfind("https://127.0.0.1:", 0)) << address;
+  const std::string hostPort = address.substr(std::string("https://").size());
+
+  const std::map<std::string, std::string> ctlEnv = {{"Q7_HOME", home_.path()}};
+  EXPECT_EQ(0, runProgram(Q7CTL_PATH, {"latency", "--cacert", tls + "/ca.pem"}, ctlEnv, &output))
+      << output;
+  EXPECT_EQ(0, runProgram(Q7CTL_PATH, {"tables", "--cacert", tls + "/ca.pem"}, ctlEnv, &output))
+      << output;
+  EXPECT_NE(std::string::npos, output.find("Q7APPSM")) << output;
+  // Without the CA the agent's certificate is not trusted, and q7ctl says what to do.
+  const int untrusted = runProgram(Q7CTL_PATH, {"tables"}, ctlEnv, &output);
+  EXPECT_TRUE(WIFEXITED(untrusted) && WEXITSTATUS(untrusted) == 1) << untrusted;
+  EXPECT_NE(std::string::npos, output.find("--cacert")) << output;
+
+  // Plain HTTP to the HTTPS port gets no HTTP answer.
+  httplib::Client plain("http://" + hostPort);
+  plain.set_connection_timeout(2);
+  plain.set_read_timeout(2);
+  const auto res = plain.Get("/healthz");
+  EXPECT_TRUE(!res || res->status != 200);
+
+  ScratchDir dir;
+  PrometheusServer prometheus(dir.path());
+  std::string error;
+  ASSERT_TRUE(
+      prometheus.Start("global:\n  scrape_interval: 1s\nscrape_configs:\n"
+                       "  - job_name: q7\n    scheme: https\n    tls_config:\n"
+                       "      ca_file: " +
+                           tls +
+                           "/ca.pem\n"
+                           "    static_configs:\n      - targets: [\"" +
+                           hostPort + "\"]\n",
+                       &error))
+      << error;
+  EXPECT_TRUE(waitFor([&] { return !prometheus.query("q7_records_read_total").empty(); }, 20s))
+      << prometheus.targets().dump();
+  stopWith(SIGTERM);
+}
+
+// Off loopback without TLS the agent serves but warns; a certificate without its key starts no
+// API at all rather than a plain one.
+TEST_F(AgentE2ETest, WarnsOfPlainHttpOffLoopbackAndNeverFallsBackToIt) {
+  extraEnv_["Q7_HTTP_ADDRESS"] = "0.0.0.0:0";
+  start();
+  EXPECT_TRUE(waitFor(
+      [&] {
+        return trace().find("reachable from other hosts over plain HTTP") != std::string::npos;
+      },
+      5s))
+      << trace();
+  stopWith(SIGTERM);
+
+  extraEnv_["Q7_HTTP_ADDRESS"] = "127.0.0.1:0";
+  extraEnv_["Q7_TLS_CERT"] = home_.path() + "agent.pem";
+  agent_ = std::make_unique<AgentProcess>(std::vector<std::string>{}, env());
+  EXPECT_TRUE(waitFor(
+      [&] {
+        return trace().find(
+                   "HTTP API not started: Q7_TLS_CERT and Q7_TLS_KEY must be set "
+                   "together") != std::string::npos;
+      },
+      10s))
+      << trace();
+  EXPECT_EQ("", readFile(home_.path() + "logs/q7agent.addr"));
   stopWith(SIGTERM);
 }
 

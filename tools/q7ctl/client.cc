@@ -29,6 +29,15 @@ std::string Describe(httplib::Error error) {
 }
 
 Result ConnectionError(const std::string& url, httplib::Error error) {
+  if (error == httplib::Error::SSLServerVerification) {
+    return Result::Error("the agent at " + url +
+                         " has a certificate that is not trusted here: give --cacert with the CA "
+                         "(or self-signed certificate) that signed it, or set Q7_TLS_CACERT");
+  }
+  if (error == httplib::Error::SSLConnection) {
+    return Result::Error("no TLS connection to the agent at " + url +
+                         ": is it serving plain HTTP? (--url http://... then)");
+  }
   return Result::Error("cannot reach the agent at " + url + ": " + Describe(error) +
                        " (is q7agent running there? --url selects another address)");
 }

@@ -76,6 +76,18 @@ TEST(RequestMetricsTest, ANewThresholdSplitsNoCountedRequests) {
 }
 
 TEST(RequestMetricsTest, TheCapHoldsAndKeepsApplicationsApart) {
+  // 10,000 distinct transactions of 25 applications against the default cap, and 30
+  // applications' against a cap smaller than their number.
+  RequestMetrics wide;
+  for (int app = 0; app < 25; ++app) {
+    for (int tx = 0; tx < 400; ++tx) {
+      wide.add("app" + std::to_string(app), "/page" + std::to_string(tx), Page(500, 100));
+    }
+  }
+  // At most the cap; short of it only by the slots held for "_other" series not needed yet.
+  EXPECT_LE(wide.series(), RequestMetrics::kDefaultMaxSeries);
+  EXPECT_GE(wide.series(), RequestMetrics::kDefaultMaxSeries - 25);
+  EXPECT_GT(wide.overflowRequests(), 0u);
   RequestMetrics m(50);
   for (int app = 0; app < 30; ++app) {
     for (int tx = 0; tx < 400; ++tx) {
