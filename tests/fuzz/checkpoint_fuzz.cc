@@ -9,7 +9,8 @@
 // Beyond not crashing, it checks:
 // - parse and load agree, and a file that does not load is set aside and nothing else;
 // - the trees never hold more rows than the sections have records;
-// - a decoded description encodes and decodes to the same values.
+// - a decoded description encodes and decodes to the same values;
+// - a latency book loaded from a section encodes and decodes to the same book.
 
 #include <cstdint>
 #include <cstring>
@@ -86,5 +87,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   }
   Check(static_cast<size_t>(trees.totalRows()) <= records,
         "the trees hold more rows than the sections have records");
+  LatencyBook again;
+  Check(LatencyBook::decode(trees.latency().encode(), &again) && again == trees.latency(),
+        "a latency book does not read back as itself");
   return 0;
 }

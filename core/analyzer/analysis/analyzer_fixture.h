@@ -81,9 +81,11 @@ class AnalyzerFixture : public ::testing::Test {
 
   void AddPattern(const char* situation, const char* appName, const char* appPattern,
                   const char* txName, const char* txPattern, int percent = 100,
-                  int16_t instances = 0, int16_t aggApp = 0, int16_t aggTx = 1) {
+                  int16_t instances = 0, int16_t aggApp = 0, int16_t aggTx = 1,
+                  int32_t thresholdMillis = 10000) {
     ASSERT_TRUE(analyzer_->newTransactionPattern(situation, appName, appPattern, txName, txPattern,
-                                                 aggApp, aggTx, instances, percent, 10000, 99));
+                                                 aggApp, aggTx, instances, percent, thresholdMillis,
+                                                 99));
   }
 
   // Each row of an over-time table as "<toString>" -> requests.

@@ -206,4 +206,63 @@ TEST_F(ProcessingTest, RolloverWithoutTraffic) {
   EXPECT_EQ(0, analyzer->getTransactionsProcessed());
 }
 
+// The latency books follow the rows: the interval's book is the current interval's pages, the
+// summary's every page since, across a rollover and a restart; /metrics counts every page once.
+TEST_F(ProcessingTest, LatencyBooksFollowTheIntervals) {
+  AddPattern("all", "Shop", "*", "Tx", "*", 100, 0, 0, 1, 250);
+  for (int rt = 10; rt <= 1000; rt += 10) {
+    Process(Page("shop.example", "/a", rt));
+  }
+  now_ = kStart + 300 + 1;
+  analyzer_->rollover();
+  Process(Page("shop.example", "/a", 5000));
+  EXPECT_EQ(1u, analyzer_->getLatency(false).applications().at("Shop").sketch.count());
+  analyzer_->finishRun();
+  analyzer_ = NewAnalyzer();
+
+  const LatencyBook summary = analyzer_->getLatency(true);
+  const LatencyEntry& shop = summary.applications().at("Shop");
+  EXPECT_EQ(101u, shop.sketch.count());
+  EXPECT_EQ(5000, shop.sketch.max());
+  EXPECT_NEAR(510, shop.sketch.quantile(0.5), 5.1);  // rank 50 of 101, within 1 %
+  EXPECT_EQ(25u, shop.satisfied);   // 10 .. 250
+  EXPECT_EQ(75u, shop.tolerating);  // 260 .. 1000
+  EXPECT_EQ(250, shop.thresholdMillis);
+  EXPECT_EQ(101u, summary.transactions().begin()->second.sketch.count());
+  // Cached between queries, and refreshed when the history changes.
+  EXPECT_EQ(summary, analyzer_->getLatency(true));
+  Process(Page("shop.example", "/a", 7));
+  EXPECT_EQ(102u, analyzer_->getLatency(true).applications().at("Shop").sketch.count());
+  // Metrics count since the process started: the new analyzer saw one page.
+  EXPECT_EQ(1u, analyzer_->getRequestMetrics().all().at(0).requests());
+}
+
+// Latency and metrics are read while the analyzer thread processes (run under TSan).
+TEST_F(ProcessingTest, LatencyAndMetricsReadWhileProcessing) {
+  AddPattern("all", "Shop", "*", "Tx", "*");
+  analyzer_.reset();
+  auto analyzer = NewAnalyzer(false);
+  analyzer->Start();
+  std::atomic<bool> done{false};
+  std::thread reader([&] {
+    while (!done.load()) {
+      analyzer->getLatency(true);
+      analyzer->getRequestMetrics();
+    }
+  });
+  for (int i = 0; i < 2000; ++i) {
+    analyzer->add({TRANSACTION_KIND_DPX, new CDPXTransaction(Page("shop.example", "/a", i % 300))});
+  }
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  while (analyzer->getTransactionsProcessed() < 2000 &&
+         std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+  }
+  done = true;
+  reader.join();
+  EXPECT_EQ(2000u, analyzer->getLatency(false).applications().at("Shop").sketch.count());
+  analyzer->Shutdown();
+  analyzer->Join();
+}
+
 }  // namespace
