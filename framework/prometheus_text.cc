@@ -93,12 +93,16 @@ void PrometheusText::appendLabel(const Label& label, bool first) {
   text_ += '"';
 }
 
-void PrometheusText::sample(std::string_view name, std::initializer_list<Label> labels,
-                            double value) {
+void PrometheusText::line(std::string_view name, std::initializer_list<Label> labels,
+                          const Label* extra, double value) {
   text_.append(name);
   bool first = true;
   for (const Label& label : labels) {
     appendLabel(label, first);
+    first = false;
+  }
+  if (extra != nullptr) {
+    appendLabel(*extra, first);
     first = false;
   }
   if (!first) {
@@ -109,18 +113,14 @@ void PrometheusText::sample(std::string_view name, std::initializer_list<Label> 
   text_ += '\n';
 }
 
+void PrometheusText::sample(std::string_view name, std::initializer_list<Label> labels,
+                            double value) {
+  line(name, labels, nullptr, value);
+}
+
 void PrometheusText::sample(std::string_view name, std::initializer_list<Label> labels, Label extra,
                             double value) {
-  text_.append(name);
-  bool first = true;
-  for (const Label& label : labels) {
-    appendLabel(label, first);
-    first = false;
-  }
-  appendLabel(extra, first);
-  text_ += "} ";
-  text_ += formatValue(value);
-  text_ += '\n';
+  line(name, labels, &extra, value);
 }
 
 }  // namespace fw

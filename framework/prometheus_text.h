@@ -36,6 +36,8 @@ class PrometheusText {
 
  private:
   void appendLabel(const Label& label, bool first);
+  void line(std::string_view name, std::initializer_list<Label> labels, const Label* extra,
+            double value);
 
   std::string text_;
 };

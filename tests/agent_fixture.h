@@ -20,6 +20,7 @@
 #include <vector>
 
 #include "tests/agent_process.h"
+#include "tests/support/catch_all_pattern.h"
 
 namespace q7test {
 
@@ -63,11 +64,7 @@ class AgentE2ETest : public ::testing::Test {
     const bool supervise = superviseCollector_;
     superviseCollector_ = false;
     const std::string address = start();
-    const std::string body = R"({"table": "Q7TXPTNS", "conditions": [
-        {"column": "APPLICATIN", "value": "All"}, {"column": "APPPATTERN", "value": "*"},
-        {"column": "TRANSACTN", "value": "All"}, {"column": "TRANSPATTN", "value": "*"},
-        {"column": "AGGAPSUNIQ", "value": "1"}, {"column": "AGGTXSUNIQ", "value": "1"},
-        {"column": "COLLINSTCS", "value": "1"}, {"column": "MRTTHRES", "value": "10000000"}]})";
+    const std::string body = CatchAllPatternBody(10000000, 1);
     std::string reply;
     const int status = send(address, "PUT", "/api/v1/situations/everything", body, token(), &reply);
     EXPECT_TRUE(status == 200 || status == 201) << status << " " << reply;

@@ -18,6 +18,7 @@
 #include <vector>
 
 #include "tests/agent_process.h"
+#include "tests/support/catch_all_pattern.h"
 #include "tests/support/prometheus_server.h"
 #include "tests/support/scratch_dir.h"
 #include "tests/support/sm3_records.h"
@@ -71,12 +72,7 @@ class FleetAgent {
     std::string token = readFile(home_.path() + "config/q7_api_token");
     token.erase(token.find_last_not_of(" \n") + 1);
     httplib::Client client("http://" + address_);
-    const std::string body = R"({"table": "Q7TXPTNS", "conditions": [
-        {"column": "APPLICATIN", "value": "All"}, {"column": "APPPATTERN", "value": "*"},
-        {"column": "TRANSACTN", "value": "All"}, {"column": "TRANSPATTN", "value": "*"},
-        {"column": "AGGAPSUNIQ", "value": "1"}, {"column": "AGGTXSUNIQ", "value": "1"},
-        {"column": "COLLINSTCS", "value": "0"}, {"column": "MRTTHRES", "value": ")" +
-                             std::to_string(kThresholdMs) + R"("}]})";
+    const std::string body = CatchAllPatternBody(kThresholdMs, 0);
     const auto res = client.Put("/api/v1/situations/everything",
                                 {{"Authorization", "Bearer " + token}}, body, "application/json");
     return res && (res->status == 200 || res->status == 201);

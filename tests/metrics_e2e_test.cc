@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "tests/agent_fixture.h"
+#include "tests/support/catch_all_pattern.h"
 #include "tests/support/prometheus_server.h"
 #include "tests/support/scratch_dir.h"
 #include "tests/support/sm3_records.h"
@@ -38,12 +39,7 @@ class MetricsE2ETest : public AgentE2ETest {
   // A catch-all pattern keeping every name, with a threshold that splits the generated times.
   void registerPattern() {
     const std::string address = start();
-    const std::string body = R"({"table": "Q7TXPTNS", "conditions": [
-        {"column": "APPLICATIN", "value": "All"}, {"column": "APPPATTERN", "value": "*"},
-        {"column": "TRANSACTN", "value": "All"}, {"column": "TRANSPATTN", "value": "*"},
-        {"column": "AGGAPSUNIQ", "value": "1"}, {"column": "AGGTXSUNIQ", "value": "1"},
-        {"column": "COLLINSTCS", "value": "0"}, {"column": "MRTTHRES", "value": ")" +
-                             std::to_string(kThresholdMs) + R"("}]})";
+    const std::string body = CatchAllPatternBody(kThresholdMs, 0);
     std::string reply;
     const int status = send(address, "PUT", "/api/v1/situations/everything", body, token(), &reply);
     ASSERT_TRUE(status == 200 || status == 201) << status << " " << reply;
@@ -62,9 +58,7 @@ class MetricsE2ETest : public AgentE2ETest {
     std::string error;
     for (const Record& record : ReadRecords(batch, &error)) {
       if (record.tag == "hpage") {
-        // The application is the URL's host, or the server's address without one.
-        const std::string& app =
-            record.text(kHost).empty() ? record.text(kServerAddress) : record.text(kHost);
+        const std::string& app = ApplicationOf(record);
         times_[app].push_back(record.number(kTotalMs));
         current_[app].push_back(record.number(kTotalMs));
       }
