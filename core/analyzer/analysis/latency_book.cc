@@ -24,18 +24,10 @@ LatencyEntry& EntryOf(LatencyBook::Entries& entries, std::string_view key) {
   return entries.emplace(std::string(key), LatencyEntry{}).first->second;
 }
 
-void PutEntries(std::string* out, uint8_t kind, const LatencyBook::Entries& entries) {
-  for (const auto& [key, entry] : entries) {
-    Put(out, kind);
-    Put(out, static_cast<uint32_t>(key.size()));
-    out->append(key);
-    Put(out, entry.thresholdMillis);
-    Put(out, entry.satisfied);
-    Put(out, entry.tolerating);
-    const std::string sketch = entry.sketch.encode();
-    Put(out, static_cast<uint32_t>(sketch.size()));
-    out->append(sketch);
-  }
+void PutKey(std::string* out, uint8_t kind, std::string_view key) {
+  Put(out, kind);
+  Put(out, static_cast<uint32_t>(key.size()));
+  out->append(key);
 }
 
 }  // namespace
@@ -84,13 +76,8 @@ std::pair<std::string_view, std::string_view> LatencyBook::splitKey(std::string_
   return {key.substr(0, nul), key.substr(nul + 1)};
 }
 
-void LatencyBook::add(std::string_view application, std::string_view transaction,
-                      int32_t thresholdMillis, double millis) {
-  LatencyEntry& app = EntryOf(applications_, application);
-  if (app.sketch.empty()) {
-    app.thresholdMillis = thresholdMillis;
-  }
-  app.add(millis);
+const LatencyEntry& LatencyBook::add(std::string_view application, std::string_view transaction,
+                                     int32_t thresholdMillis, double millis) {
   // One key buffer per thread: building the key must not allocate for every request.
   thread_local std::string key;
   key.assign(application).push_back('\0');
@@ -98,29 +85,60 @@ void LatencyBook::add(std::string_view application, std::string_view transaction
   LatencyEntry& tx = EntryOf(transactions_, key);
   if (tx.sketch.empty()) {
     tx.thresholdMillis = thresholdMillis;
+    if (thresholds_.find(application) == thresholds_.end()) {
+      thresholds_.emplace(std::string(application), thresholdMillis);
+    }
   }
   tx.add(millis);
+  return tx;
+}
+
+LatencyBook::Entries LatencyBook::applications() const {
+  Entries out;
+  for (const auto& [key, entry] : transactions_) {
+    const std::string_view application = splitKey(key).first;
+    LatencyEntry& app = EntryOf(out, application);
+    app.sketch.merge(entry.sketch);
+    app.satisfied += entry.satisfied;
+    app.tolerating += entry.tolerating;
+  }
+  for (auto& [application, entry] : out) {
+    const auto threshold = thresholds_.find(application);
+    entry.thresholdMillis = threshold != thresholds_.end() ? threshold->second : 0;
+  }
+  return out;
 }
 
 void LatencyBook::merge(const LatencyBook& other) {
-  for (const auto& [key, entry] : other.applications_) {
-    EntryOf(applications_, key).merge(entry);
-  }
   for (const auto& [key, entry] : other.transactions_) {
     EntryOf(transactions_, key).merge(entry);
+  }
+  for (const auto& [application, threshold] : other.thresholds_) {
+    thresholds_[application] = threshold;
   }
 }
 
 void LatencyBook::clear() {
-  applications_.clear();
+  thresholds_.clear();
   transactions_.clear();
 }
 
 std::string LatencyBook::encode() const {
   std::string out(kMagic, sizeof(kMagic));
-  Put(&out, static_cast<uint64_t>(applications_.size() + transactions_.size()));
-  PutEntries(&out, kApplicationKind, applications_);
-  PutEntries(&out, kTransactionKind, transactions_);
+  Put(&out, static_cast<uint64_t>(thresholds_.size() + transactions_.size()));
+  for (const auto& [application, threshold] : thresholds_) {
+    PutKey(&out, kApplicationKind, application);
+    Put(&out, threshold);
+  }
+  for (const auto& [key, entry] : transactions_) {
+    PutKey(&out, kTransactionKind, key);
+    Put(&out, entry.thresholdMillis);
+    Put(&out, entry.satisfied);
+    Put(&out, entry.tolerating);
+    const std::string sketch = entry.sketch.encode();
+    Put(&out, static_cast<uint32_t>(sketch.size()));
+    out.append(sketch);
+  }
   return out;
 }
 
@@ -141,8 +159,15 @@ bool LatencyBook::decode(std::string_view bytes, LatencyBook* book) {
         bytes.size() < keyLength) {
       return false;
     }
-    const std::string_view key = bytes.substr(0, keyLength);
+    const std::string key(bytes.substr(0, keyLength));
     bytes.remove_prefix(keyLength);
+    if (kind == kApplicationKind) {
+      int32_t threshold = 0;
+      if (!Take(&bytes, &threshold) || !read.thresholds_.emplace(key, threshold).second) {
+        return false;
+      }
+      continue;
+    }
     LatencyEntry entry;
     uint32_t sketchLength = 0;
     if (!Take(&bytes, &entry.thresholdMillis) || !Take(&bytes, &entry.satisfied) ||
@@ -154,8 +179,7 @@ bool LatencyBook::decode(std::string_view bytes, LatencyBook* book) {
       return false;
     }
     bytes.remove_prefix(sketchLength);
-    Entries& entries = kind == kApplicationKind ? read.applications_ : read.transactions_;
-    if (!entries.emplace(std::string(key), std::move(entry)).second) {
+    if (!read.transactions_.emplace(key, std::move(entry)).second) {
       return false;  // a key twice: not a book this wrote
     }
   }

@@ -1,15 +1,16 @@
 #pragma once
 
 // LatencyBook: the response-time sketches of one interval (or of a window of intervals), one per
-// application and one per application and transaction, with the apdex counts at each key's
-// threshold. It sits beside the interval's over-time trees, is updated by the same page
-// transactions as the application and transaction rows, and is saved, loaded and checkpointed
-// with them as one more history stem. Merging the books of a day's intervals gives the day's
-// percentiles to the sketch's accuracy.
+// application and transaction, with the apdex counts at each one's threshold. It sits beside the
+// interval's over-time trees, is updated by the same page transactions as the application and
+// transaction rows, and is saved, loaded and checkpointed with them as one more history stem.
+// Merging the books of a day's intervals gives the day's percentiles to the sketch's accuracy.
+// An application's figures are its transactions' merged when asked for: one lookup per request.
 //
-// A key's threshold T is the one of its first request, as its rows keep theirs. Apdex counts
-// requests by response time alone, as the histogram in /metrics does: satisfied at most T,
-// tolerating at most 4T.
+// A transaction's threshold T is the one of its first request, as its rows keep theirs; an
+// application's is the one of its first transaction. Apdex counts requests by response time
+// alone, as the histogram in /metrics does: satisfied at most T, tolerating at most 4T, each
+// transaction at its own T.
 //
 // Thread safety: none of its own; the analyzer's tree lock guards the book of its trees.
 
@@ -33,6 +34,9 @@ struct LatencyEntry {
   uint64_t satisfied = 0;   // at most the threshold
   uint64_t tolerating = 0;  // over the threshold, at most four times it
   int32_t thresholdMillis = 0;
+  // Not part of the figures: the request-metrics series this key counts under, found once per
+  // interval instead of once per request (RequestMetrics::kUnresolved until then).
+  mutable int32_t metricsSeries = -1;
 
   void add(double millis);
   // Adds other's requests; the threshold becomes other's when other has requests, so that
@@ -40,7 +44,10 @@ struct LatencyEntry {
   void merge(const LatencyEntry& other);
   // (satisfied + tolerating / 2) / requests; 1 with no requests.
   double apdex() const;
-  bool operator==(const LatencyEntry& other) const = default;
+  bool operator==(const LatencyEntry& other) const {
+    return sketch == other.sketch && satisfied == other.satisfied &&
+           tolerating == other.tolerating && thresholdMillis == other.thresholdMillis;
+  }
 };
 
 class LatencyBook {
@@ -55,14 +62,16 @@ class LatencyBook {
   };
   using Entries = std::unordered_map<std::string, LatencyEntry, KeyHash, std::equal_to<>>;
 
-  // One page request of application and transaction that took millis, under threshold.
-  void add(std::string_view application, std::string_view transaction, int32_t thresholdMillis,
-           double millis);
+  // One page request of application and transaction that took millis, under threshold; the
+  // transaction's entry.
+  const LatencyEntry& add(std::string_view application, std::string_view transaction,
+                          int32_t thresholdMillis, double millis);
   void merge(const LatencyBook& other);
   void clear();
-  bool empty() const { return applications_.empty(); }
+  bool empty() const { return transactions_.empty(); }
 
-  const Entries& applications() const { return applications_; }
+  // By application: its transactions merged, under its threshold.
+  Entries applications() const;
   const Entries& transactions() const { return transactions_; }
   static std::string transactionKey(std::string_view application, std::string_view transaction);
   // Splits a transactions() key into its application and transaction.
@@ -87,6 +96,7 @@ class LatencyBook {
   bool operator==(const LatencyBook& other) const = default;
 
  private:
-  Entries applications_;
+  // Each application's threshold: its first transaction's, or the latest merged in.
+  std::unordered_map<std::string, int32_t, KeyHash, std::equal_to<>> thresholds_;
   Entries transactions_;
 };

@@ -30,7 +30,8 @@ TEST(LatencyBookTest, ApdexCountsAtTheKeysThreshold) {
   EXPECT_EQ(21u, cart.satisfied);   // 0 .. 500
   EXPECT_EQ(60u, cart.tolerating);  // 525 .. 2000
   EXPECT_DOUBLE_EQ((21 + 30) / 100.0, cart.apdex());
-  const LatencyEntry& shop = book.applications().at("Shop");
+  const LatencyBook::Entries applications = book.applications();
+  const LatencyEntry& shop = applications.at("Shop");
   EXPECT_EQ(200u, shop.sketch.count());
   EXPECT_EQ(121u, shop.satisfied);
   EXPECT_EQ(500, shop.thresholdMillis);
@@ -49,6 +50,15 @@ TEST(LatencyBookTest, MergingKeepsTheLatestThreshold) {
   // An empty entry changes nothing, its threshold included.
   older.merge(LatencyBook{});
   EXPECT_EQ(2000, older.applications().at("Shop").thresholdMillis);
+  // An application's threshold is its first transaction's; its apdex counts each transaction
+  // at its own.
+  LatencyBook mixed;
+  mixed.add("Shop", "/fast", 100, 150);   // tolerating at 100
+  mixed.add("Shop", "/slow", 1000, 150);  // satisfied at 1000
+  const LatencyEntry shop = mixed.applications().at("Shop");
+  EXPECT_EQ(100, shop.thresholdMillis);
+  EXPECT_EQ(1u, shop.satisfied);
+  EXPECT_EQ(1u, shop.tolerating);
 }
 
 TEST(LatencyBookTest, EncodingReadsBackAndRefusesDamage) {

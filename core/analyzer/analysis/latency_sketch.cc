@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cmath>
 #include <cstring>
+#include <vector>
 
 #include "core/analyzer/analysis/byte_codec.h"
 
@@ -23,8 +24,37 @@ constexpr char kMagic[] = {'q', '7', 's', 'k', 1};
 
 }  // namespace
 
-int32_t LatencySketch::indexOf(double millis) {
+namespace {
+
+int32_t ComputeIndex(double millis) {
   return static_cast<int32_t>(std::ceil(std::log(std::min(millis, kLargest)) / kLogGamma));
+}
+
+// Response times arrive in whole milliseconds: their indexes come from a table (128 KiB) instead
+// of a logarithm per request, computed by the same function so both ways agree exactly.
+constexpr int kTabled = 1 << 16;
+
+const std::vector<int16_t>& IndexTable() {
+  static const std::vector<int16_t> table = [] {
+    std::vector<int16_t> t(kTabled);
+    for (int ms = 1; ms < kTabled; ++ms) {
+      t[ms] = static_cast<int16_t>(ComputeIndex(ms));
+    }
+    return t;
+  }();
+  return table;
+}
+
+}  // namespace
+
+int32_t LatencySketch::indexOf(double millis) {
+  if (millis >= 1 && millis < kTabled) {
+    const auto whole = static_cast<int>(millis);
+    if (whole == millis) {
+      return IndexTable()[whole];
+    }
+  }
+  return ComputeIndex(millis);
 }
 
 double LatencySketch::valueOf(int32_t index) {

@@ -8,8 +8,8 @@
 
 #include <memory>
 #include <random>
-#include <utility>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "core/analyzer/rows/rows.h"
@@ -66,7 +66,8 @@ void ExpectIndexAgreesWithTree(OverTimeTable table) {
       ASSERT_EQ(previous->equals(probe, 0), previous->hasKeyOf(t)) << "transaction " << i;
     }
     if (previous != nullptr) {
-      for (auto [a, b] : {std::pair<Row*, Row*>{&probe, previous.get()}, {previous.get(), &probe},
+      for (auto [a, b] : {std::pair<Row*, Row*>{&probe, previous.get()},
+                          {previous.get(), &probe},
                           {&probe, &probe}}) {
         const int literal = a->greater(*b, 0) ? 1 : (a->equals(*b, 0) ? 0 : -1);
         ASSERT_EQ(literal, a->compare(*b, 0)) << "transaction " << i;
@@ -74,9 +75,10 @@ void ExpectIndexAgreesWithTree(OverTimeTable table) {
     }
     TreeNode* const viaTree = trees.tree(table).findNode(&probe);
     ASSERT_EQ(viaTree, trees.find(table, hash, probe)) << "transaction " << i;
-    ASSERT_EQ(viaTree, trees.findIf(table, hash, [&t](TreeNode* row) {
-      return static_cast<Row*>(row)->hasKeyOf(t);
-    })) << "transaction " << i;
+    ASSERT_EQ(viaTree,
+              trees.findIf(table, hash,
+                           [&t](TreeNode* row) { return static_cast<Row*>(row)->hasKeyOf(t); }))
+        << "transaction " << i;
     found += viaTree != nullptr;
     if (viaTree == nullptr && random() % 3 != 0) {
       auto row = std::make_unique<Row>(t);

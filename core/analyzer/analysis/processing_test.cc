@@ -221,12 +221,12 @@ TEST_F(ProcessingTest, LatencyBooksFollowTheIntervals) {
   analyzer_ = NewAnalyzer();
 
   const LatencyBook summary = analyzer_->getLatency(true);
-  const LatencyEntry& shop = summary.applications().at("Shop");
+  const LatencyEntry shop = summary.applications().at("Shop");
   EXPECT_EQ(101u, shop.sketch.count());
   EXPECT_EQ(5000, shop.sketch.max());
   EXPECT_NEAR(510, shop.sketch.quantile(0.5), 5.1);  // rank 50 of 101, within 1 %
-  EXPECT_EQ(25u, shop.satisfied);   // 10 .. 250
-  EXPECT_EQ(75u, shop.tolerating);  // 260 .. 1000
+  EXPECT_EQ(25u, shop.satisfied);                    // 10 .. 250
+  EXPECT_EQ(75u, shop.tolerating);                   // 260 .. 1000
   EXPECT_EQ(250, shop.thresholdMillis);
   EXPECT_EQ(101u, summary.transactions().begin()->second.sketch.count());
   // Cached between queries, and refreshed when the history changes.

@@ -65,42 +65,56 @@ RequestMetrics::Series& RequestMetrics::seriesFor(std::string_view application,
   if (const auto found = index_.find(key); found != index_.end()) {
     return series_[found->second];
   }
-  const bool catchAllExists = index_.contains(KeyOf(kOther, kOther));
-  const size_t used = series_.size() + reservedOthers_ + (catchAllExists ? 0 : 1);
-  const auto known = hasOther_.find(application);
-  if (known != hasOther_.end()) {
+  const size_t used = series_.size() + reservedOthers_ + (catchAll_ < 0 ? 1 : 0);
+  const auto known = others_.find(application);
+  if (known != others_.end()) {
     if (used < maxSeries_) {
       return create(application, transaction, key);
     }
     *overflow = true;
-    std::string otherKey = KeyOf(application, kOther);
-    if (const auto found = index_.find(otherKey); found != index_.end()) {
-      return series_[found->second];
+    if (known->second < 0) {
+      // The slot this application held for it.
+      --reservedOthers_;
+      known->second = static_cast<int32_t>(series_.size());
+      create(application, kOther, KeyOf(application, kOther));
     }
-    // The slot this application held for it.
-    known->second = true;
-    --reservedOthers_;
-    return create(application, kOther, std::move(otherKey));
+    return series_[static_cast<size_t>(known->second)];
   }
   if (used + 2 <= maxSeries_) {
-    hasOther_.emplace(std::string(application), false);
+    others_.emplace(std::string(application), -1);
     ++reservedOthers_;
     return create(application, transaction, key);
   }
   *overflow = true;
-  std::string catchAll = KeyOf(kOther, kOther);
-  if (const auto found = index_.find(catchAll); found != index_.end()) {
-    return series_[found->second];
+  if (catchAll_ < 0) {
+    catchAll_ = static_cast<int32_t>(series_.size());
+    create(kOther, kOther, KeyOf(kOther, kOther));
   }
-  return create(kOther, kOther, std::move(catchAll));
+  return series_[static_cast<size_t>(catchAll_)];
 }
 
 void RequestMetrics::add(std::string_view application, std::string_view transaction,
                          const Request& request) {
-  addBound(request.thresholdMillis);
-  addBound(4 * request.thresholdMillis);
-  bool overflow = false;
-  Series& series = seriesFor(application, transaction, &overflow);
+  int32_t series = kUnresolved;
+  add(application, transaction, request, &series);
+}
+
+void RequestMetrics::add(std::string_view application, std::string_view transaction,
+                         const Request& request, int32_t* cached) {
+  if (request.thresholdMillis != lastThreshold_) {
+    addBound(request.thresholdMillis);
+    addBound(4 * request.thresholdMillis);
+    lastThreshold_ = request.thresholdMillis;
+  }
+  // The cache holds the index, or -2 - index for an "_other" series standing in for the key.
+  if (*cached == kUnresolved) {
+    bool overflow = false;
+    const auto index =
+        static_cast<int32_t>(&seriesFor(application, transaction, &overflow) - series_.data());
+    *cached = overflow ? -2 - index : index;
+  }
+  const bool overflow = *cached < 0;
+  Series& series = series_[static_cast<size_t>(overflow ? -2 - *cached : *cached)];
   if (overflow) {
     ++overflowRequests_;
   }

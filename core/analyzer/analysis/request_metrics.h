@@ -48,7 +48,14 @@ class RequestMetrics {
 
   explicit RequestMetrics(size_t maxSeries = kDefaultMaxSeries);
 
+  // A cached series for a key: kUnresolved until the first add finds it.
+  static constexpr int32_t kUnresolved = -1;
+
   void add(std::string_view application, std::string_view transaction, const Request& request);
+  // The same, with *series caching the key's series between calls (start at kUnresolved; the
+  // cache stays valid for the life of this object).
+  void add(std::string_view application, std::string_view transaction, const Request& request,
+           int32_t* series);
 
   size_t series() const { return series_.size(); }
   size_t maxSeries() const { return maxSeries_; }
@@ -91,8 +98,11 @@ class RequestMetrics {
   std::vector<Series> series_;
   // Series by application NUL transaction.
   std::unordered_map<std::string, size_t, LatencyBook::KeyHash, std::equal_to<>> index_;
-  // Applications that have a series but no "_other" series yet: each holds a slot for it.
-  size_t reservedOthers_ = 0;
-  std::unordered_map<std::string, bool, LatencyBook::KeyHash, std::equal_to<>> hasOther_;
+  // Each application with a series of its own: the index of its "_other" series, or -1 while
+  // it holds a slot for one.
+  std::unordered_map<std::string, int32_t, LatencyBook::KeyHash, std::equal_to<>> others_;
+  size_t reservedOthers_ = 0;  // applications holding a slot
+  int32_t catchAll_ = -1;      // the "_other"/"_other" series, once made
   uint64_t overflowRequests_ = 0;
+  int32_t lastThreshold_ = -1;  // bounds are in place for it
 };

@@ -66,8 +66,20 @@ void UpdatePageTables(COverTimeTrees& trees, CDPXTransaction& w) {
                                     "Error adding to CTOT tree!");
   UpdateTable<CClientAppOverTime>(trees, OverTimeTable::kClientApp, w,
                                   "Error adding to CAOT tree!");
-  trees.latency().add(FieldText(w.getApplicationName()), FieldText(w.getTransactionName()),
-                      w.getMinThreshold(), w.getTotalResponseTime());
+}
+
+// The page's latency in its interval's book, and in the metrics since the start (through the
+// book entry's cached series).
+void UpdateLatency(COverTimeTrees& trees, RequestMetrics& metrics, CDPXTransaction& w) {
+  const std::string_view application = FieldText(w.getApplicationName());
+  const std::string_view transaction = FieldText(w.getTransactionName());
+  const int32_t response = w.getTotalResponseTime();
+  const LatencyEntry& entry =
+      trees.latency().add(application, transaction, w.getMinThreshold(), response);
+  metrics.add(application, transaction,
+              {w.getMinThreshold(), response, w.getServerTime(), w.getNetworkTime(),
+               response - w.getServerTime(), w.isBadStatusCode(), w.getRequestStatus()},
+              &entry.metricsSeries);
 }
 
 // Sets the client field of w whose text is value to its first three address parts, cut to the
@@ -286,11 +298,7 @@ void CDPXAnalyzer::processTransaction(CDPXTransaction& transaction, short* insta
           selectTreesFor(w.getTimeRecorded());
           if (page) {
             UpdatePageTables(cache->trees(), w);
-            const int32_t response = w.getTotalResponseTime();
-            requestMetrics->add(
-                FieldText(w.getApplicationName()), FieldText(w.getTransactionName()),
-                {w.getMinThreshold(), response, w.getServerTime(), w.getNetworkTime(),
-                 response - w.getServerTime(), w.isBadStatusCode(), w.getRequestStatus()});
+            UpdateLatency(cache->trees(), *requestMetrics, w);
           }
           const int level = instance.level;
           if (level == 1 || (level == 2 && w.isBadStatusCode())) {
