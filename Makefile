@@ -68,7 +68,7 @@ asan: deps
 	fi
 	cmake -S . -B build-asan $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DQ7_SANITIZE=ON -DQ7_FUZZ=ON \
 	  -DCMAKE_C_COMPILER=clang -DCMAKE_CXX_COMPILER=clang++ -DQ7_BUILD_E2E=OFF -DQ7_BUILD_BENCH=OFF
-	cmake --build build-asan -j $(JOBS)
+	cmake --build build-asan -j $(JOBS) --target unit_tests $(FUZZ_TARGETS)
 	cd build-asan && ctest --output-on-failure -j $(JOBS) -L unit --timeout 300
 	$(MAKE) --no-print-directory -j $(JOBS) -O fuzz-smoke-run FUZZ_DIR=build-asan
 

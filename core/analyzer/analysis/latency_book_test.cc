@@ -67,7 +67,8 @@ TEST(LatencyBookTest, EncodingReadsBackAndRefusesDamage) {
   LatencyBook back;
   ASSERT_TRUE(LatencyBook::decode(bytes, &back));
   EXPECT_EQ(book, back);
-  const auto [app, tx] = LatencyBook::splitKey(LatencyBook::transactionKey("News", "x"));
+  const std::string key = LatencyBook::transactionKey("News", "x");
+  const auto [app, tx] = LatencyBook::splitKey(key);
   EXPECT_EQ("News", app);
   EXPECT_EQ("x", tx);
 
