@@ -137,6 +137,12 @@ class CrashE2ETest : public AgentE2ETest {
     for (const auto& row : apps["rows"]) {
       counted[row["applicatin"].get<std::string>()] += row["totreq"].get<long>();
     }
+    // The latency sketches are checkpointed with the rows: none lost or counted twice either.
+    std::map<std::string, long> sketched;
+    const nlohmann::json latency = get(address, "/api/v1/latency?window=summary", &status);
+    for (const auto& row : latency["rows"]) {
+      sketched[row["application"].get<std::string>()] += row["requests"].get<long>();
+    }
     const long summaryObjects = totalRequests(get(address, "/api/v1/tables/Q7SUBTXSM", &status));
     stopWith(SIGTERM);  // saves the current interval, so the history is whole
 
@@ -182,6 +188,7 @@ class CrashE2ETest : public AgentE2ETest {
         pageInstances - pages, objectInstances, objectInstances - objects, lastResume.c_str(),
         lastRenamed.c_str());
     EXPECT_EQ(pagesByApp, counted);
+    EXPECT_EQ(pagesByApp, sketched) << "latency sketches";
     // A summary by URL folds at most MAX_ROWS (25,000) history rows, and nearly every page has
     // a URL of its own: beyond that the per-URL totals are short by design.
     const long pageRows = historyOf<kq7_q7txot_data_t>("q7txot").first;
