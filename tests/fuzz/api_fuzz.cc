@@ -10,12 +10,14 @@
 //   input, exactly one of LT, EQ and GT holds and each operator is the negation of its opposite;
 // - a limit parses exactly when it is digits within 64 bits, to the number those digits say;
 // - a situation that starts replies with a body which, sent back as the PUT body, replaces it
-//   with the same situation.
+//   with the same situation;
+// - a latency query is answered 200 or 400, with only rows the agent gave (all of them with no
+//   where), and a label value from the input stays inside its one line of /metrics text.
 //
 // Input: two header bytes, then text.
-//   byte 0 % 3: 0 a where (up to the first line break, then the row's bytes), 1 a limit and a
+//   byte 0 % 4: 0 a where (up to the first line break, then the row's bytes), 1 a limit and a
 //               format (the text), 2 a situation PUT (name up to the first line break, then
-//               the body)
+//               the body), 3 a latency query string and a label value (the text)
 //   byte 1: the table the where runs on
 
 #include <httplib.h>
@@ -31,6 +33,8 @@
 #include <string_view>
 #include <vector>
 
+#include "framework/metrics_api.h"
+#include "framework/prometheus_text.h"
 #include "framework/request.h"
 #include "framework/row_filter.h"
 #include "framework/sample_query.h"
@@ -168,10 +172,67 @@ void CheckSituationPut(InMemoryServer& server, std::string_view input) {
   fw::ResetSituations();
 }
 
+// ---- Latency and metrics through the routes ----
+
+std::vector<fw::LatencyRow> LatencyRows() {
+  std::vector<fw::LatencyRow> rows;
+  for (const char* app : {"Shop", "News", "a b", ""}) {
+    for (const char* tx : {"/", "/cart?x=1", "All"}) {
+      fw::LatencyRow row;
+      row.application = app;
+      row.transaction = tx;
+      row.requests = rows.size() * 7;
+      row.p50_ms = 10.5 * static_cast<double>(rows.size());
+      row.p90_ms = row.p95_ms = row.p99_ms = row.max_ms = 2 * row.p50_ms;
+      row.apdex = 1.0 / static_cast<double>(rows.size() + 1);
+      row.threshold_ms = 500;
+      rows.push_back(row);
+    }
+  }
+  return rows;
+}
+
+void CheckLatencyQuery(InMemoryServer& server, std::string_view input) {
+  std::string request = "GET /api/v1/latency?";
+  for (const char c : input) {
+    // Bytes that would end the request line are sent encoded; the rest as they come.
+    if (c == ' ' || c == '\r' || c == '\n' || c == '\0' || c == '#') {
+      char hex[4];
+      std::snprintf(hex, sizeof(hex), "%%%02X", static_cast<unsigned char>(c));
+      request += hex;
+    } else {
+      request += c;
+    }
+  }
+  request += " HTTP/1.1\r\nHost: fuzz\r\n\r\n";
+  std::string reply;
+  const int status = server.Serve(request, &reply);
+  Check(status == 200 || status == 400, "a latency query answered with another status");
+  if (status == 200) {
+    const nlohmann::json body = nlohmann::json::parse(reply, nullptr, false);
+    Check(body.is_object() && body["rows"].is_array(), "a latency answer without rows");
+    Check(body["rows"].size() <= LatencyRows().size(), "a latency answer with rows of its own");
+    // (A where may hide behind percent-encoding.)
+    if (input.find("where") == std::string_view::npos &&
+        input.find('%') == std::string_view::npos) {
+      Check(body["rows"].size() == LatencyRows().size(), "rows lost without a where");
+    }
+  }
+
+  fw::PrometheusText text;
+  text.sample("q7_fuzz", {{"label", input}}, 1);
+  const std::string& line = text.text();
+  Check(std::count(line.begin(), line.end(), '\n') == 1 && line.back() == '\n',
+        "a label value broke its line");
+  Check(line.rfind("} 1\n") == line.size() - 4, "a label value broke out of its quotes");
+}
+
 InMemoryServer& Server() {
   static InMemoryServer* server = [] {
     auto* s = new InMemoryServer;
     fw::InstallSituationRoutes(*s);
+    fw::InstallMetricsRoutes(*s);
+    fw::SetLatencyProvider([](const fw::LatencyQuery&) { return LatencyRows(); });
     return s;
   }();
   return *server;
@@ -193,15 +254,18 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const std::vector<std::shared_ptr<const fw::TableDefinition>> tables = fw::ListTables();
   Check(!tables.empty(), "no table registered");
   const std::string_view text(reinterpret_cast<const char*>(data) + 2, size - 2);
-  switch (data[0] % 3) {
+  switch (data[0] % 4) {
     case 0:
       CheckWhere(*tables[data[1] % tables.size()], text);
       break;
     case 1:
       CheckLimitAndFormat(text);
       break;
-    default:
+    case 2:
       CheckSituationPut(Server(), text);
+      break;
+    default:
+      CheckLatencyQuery(Server(), text);
       break;
   }
   return 0;
