@@ -10,7 +10,6 @@
 #include <map>
 #include <nlohmann/json.hpp>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "tests/agent_fixture.h"
@@ -124,9 +123,7 @@ class MetricsE2ETest : public AgentE2ETest {
 
 TEST_F(MetricsE2ETest, PercentilesHoldAcrossAKillARolloverAndARestart) {
   // Room for the first batch and the kill before the minute ends.
-  while (time(nullptr) % 60 > 40) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(200));
-  }
+  ASSERT_TRUE(waitFor([] { return time(nullptr) % 60 <= 40; }, 25s));
   const long interval = time(nullptr) / 60;
   std::string address = start();
   feed(3000, 11);

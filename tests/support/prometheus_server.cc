@@ -5,9 +5,9 @@
 #include <filesystem>
 #include <fstream>
 #include <sstream>
-#include <thread>
 
 #include "tests/support/nginx_server.h"
+#include "tests/support/test_util.h"
 
 namespace q7test {
 namespace {
@@ -57,19 +57,21 @@ bool PrometheusServer::Start(const std::string& config, std::string* error) {
   }
   httplib::Client client("127.0.0.1", port_);
   client.set_connection_timeout(1);
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-  while (std::chrono::steady_clock::now() < deadline) {
-    if (!process_->running()) {
-      *error = "prometheus exited: " + log();
-      return false;
-    }
-    const auto res = client.Get("/-/ready");
-    if (res && res->status == 200) {
-      return true;
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  bool exited = false;
+  const bool ready = PollUntil(
+      [&] {
+        exited = !process_->running();
+        if (exited) {
+          return true;
+        }
+        const auto res = client.Get("/-/ready");
+        return res && res->status == 200;
+      },
+      std::chrono::seconds(30));
+  if (ready && !exited) {
+    return true;
   }
-  *error = "prometheus not ready within 30 s: " + log();
+  *error = (exited ? "prometheus exited: " : "prometheus not ready within 30 s: ") + log();
   return false;
 }
 

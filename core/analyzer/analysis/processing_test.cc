@@ -23,6 +23,7 @@
 #include "framework/clock.h"
 #include "framework/trace_capture.h"
 #include "tests/support/scratch_dir.h"
+#include "tests/support/test_util.h"
 
 namespace {
 
@@ -253,11 +254,8 @@ TEST_F(ProcessingTest, LatencyAndMetricsReadWhileProcessing) {
   for (int i = 0; i < 2000; ++i) {
     analyzer->add({TRANSACTION_KIND_DPX, new CDPXTransaction(Page("shop.example", "/a", i % 300))});
   }
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
-  while (analyzer->getTransactionsProcessed() < 2000 &&
-         std::chrono::steady_clock::now() < deadline) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(5));
-  }
+  EXPECT_TRUE(q7test::PollUntil([&] { return analyzer->getTransactionsProcessed() >= 2000; },
+                                std::chrono::seconds(20)));
   done = true;
   reader.join();
   EXPECT_EQ(2000u, analyzer->getLatency(false).applications().at("Shop").sketch.count());
