@@ -1,6 +1,7 @@
 #include "core/analyzer/analysis/request_metrics.h"
 
 #include <algorithm>
+#include <limits>
 
 #include "framework/prometheus_text.h"
 
@@ -103,7 +104,11 @@ void RequestMetrics::add(std::string_view application, std::string_view transact
                          const Request& request, int32_t* cached) {
   if (request.thresholdMillis != lastThreshold_) {
     addBound(request.thresholdMillis);
-    addBound(4 * request.thresholdMillis);
+    // A threshold meant as "never slow" (up to 2^31 ms) has no 4T bucket worth having.
+    if (const int64_t tolerating = 4 * static_cast<int64_t>(request.thresholdMillis);
+        tolerating <= std::numeric_limits<int32_t>::max()) {
+      addBound(static_cast<int32_t>(tolerating));
+    }
     lastThreshold_ = request.thresholdMillis;
   }
   // The cache holds the index, or -2 - index for an "_other" series standing in for the key.

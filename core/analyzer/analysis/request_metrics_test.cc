@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <limits>
 #include <set>
 #include <string>
 
@@ -73,6 +74,10 @@ TEST(RequestMetricsTest, ANewThresholdSplitsNoCountedRequests) {
   // Counted before the bound existed: above it, so every cumulative count stays as it was.
   EXPECT_EQ(below, AtOrBelow(m, shop, 600));
   EXPECT_EQ(10u, AtOrBelow(m, shop, 1000));
+  // The largest threshold a pattern takes is a bound; four times it does not fit and is none.
+  m.add("Never", "/", Page(std::numeric_limits<int32_t>::max(), 10));
+  EXPECT_EQ(std::numeric_limits<int32_t>::max(), m.bounds().back());
+  EXPECT_EQ(1u, Find(m, "Never", "/").good);
 }
 
 TEST(RequestMetricsTest, TheCapHoldsAndKeepsApplicationsApart) {
