@@ -62,6 +62,19 @@ std::string EscapeControls(const std::string& text) {
   return out;
 }
 
+// Numbers, and percentages q7ctl made readable ("12.5%"), align right and are never cut.
+bool IsNumeric(const Json& value) {
+  if (value.is_number()) {
+    return true;
+  }
+  if (!value.is_string()) {
+    return false;
+  }
+  const std::string& text = value.get_ref<const std::string&>();
+  return text.size() >= 2 && text.back() == '%' &&
+         text.find_first_not_of("-0123456789.") == text.size() - 1;
+}
+
 const Json& Cell(const Json& row, const std::string& column) {
   static const Json kNull;
   if (!row.is_object()) {
@@ -102,7 +115,7 @@ class TableLayout {
     for (std::size_t i = 0; i < columns_.size(); ++i) {
       const Json& value = Cell(row, columns_[i]);
       widths_[i] = std::max(widths_[i], DisplayWidth(Text(value)));
-      if (value.is_number()) {
+      if (IsNumeric(value)) {
         ++numbers_[i];
       } else if (!value.is_null()) {
         ++texts_[i];
@@ -123,7 +136,7 @@ class TableLayout {
     std::vector<std::pair<std::string, bool>> cells;
     for (const std::string& column : columns_) {
       const Json& value = Cell(row, column);
-      cells.emplace_back(Text(value), value.is_number());
+      cells.emplace_back(Text(value), IsNumeric(value));
     }
     return Line(cells);
   }
@@ -131,7 +144,7 @@ class TableLayout {
  private:
   std::string Text(const Json& value) const {
     std::string text = EscapeControls(CellText(value));
-    if (value.is_number() || options_.wide) {
+    if (IsNumeric(value) || options_.wide) {
       return text;
     }
     return Truncate(text, options_.max_width);

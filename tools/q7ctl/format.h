@@ -28,6 +28,8 @@ struct FormatOptions {
   // unless wide is set. Numbers are never cut.
   bool wide = false;
   std::size_t max_width = 40;
+  // Timestamps and percentages in readable forms (readable.h); the caller converts the rows.
+  bool readable = false;
 };
 
 // Parses "table", "json" or "csv".

@@ -9,6 +9,7 @@
 #include "tools/q7ctl/client.h"
 #include "tools/q7ctl/config.h"
 #include "tools/q7ctl/format.h"
+#include "tools/q7ctl/readable.h"
 
 namespace q7ctl {
 namespace {
@@ -40,6 +41,7 @@ struct Globals {
   std::string cacert;
   std::string output = "table";
   bool wide = false;
+  bool raw = false;
 };
 
 int Fail(const Result& result) {
@@ -105,7 +107,7 @@ int Sample(ApiClient& client, const FormatOptions& options, const std::string& t
   if (rows.empty()) {
     SayNone(options, "rows");
   }
-  WriteRows(rows, options, std::cout);
+  WriteRows(options.readable ? ReadableRows(rows) : rows, options, std::cout);
   return 0;
 }
 
@@ -205,14 +207,14 @@ int Events(ApiClient& client, const FormatOptions& options, bool follow) {
     if (events.empty()) {
       SayNone(options, "events");
     }
-    WriteRows(events, options, std::cout);
+    WriteRows(options.readable ? ReadableRows(events) : events, options, std::cout);
     return 0;
   }
   StreamWriter writer(options, std::cout);
-  writer.Begin(events);
+  writer.Begin(options.readable ? ReadableRows(events) : events);
   // Runs until the agent ends the stream or the operator interrupts q7ctl.
-  return Fail(client.Stream("/api/v1/events/stream", [&writer](const Json& event) {
-    writer.Write(event);
+  return Fail(client.Stream("/api/v1/events/stream", [&writer, &options](const Json& event) {
+    writer.Write(options.readable ? ReadableRows(Json::array({event}))[0] : event);
     return true;
   }));
 }
@@ -250,6 +252,9 @@ int Run(int argc, char** argv) {
       ->check(CLI::IsMember({"table", "json", "csv"}))
       ->capture_default_str();
   app.add_flag("--wide", globals.wide, "Table output: do not cut long text columns");
+  app.add_flag("--raw", globals.raw,
+               "Table and CSV output: keep the agent's values as they are (timestamps as "
+               "CYYMMDDHHMMSSmmm, percentages in thousandths), as JSON output always does");
 
   CLI::App* tables = app.add_subcommand("tables", "List the agent's tables in load order");
   tables->footer(Help("Example:\n  q7ctl tables\n  q7ctl tables -o json   # with every column"));
@@ -341,6 +346,7 @@ int Run(int argc, char** argv) {
   FormatOptions options;
   ParseOutputFormat(globals.output, &options.format);
   options.wide = globals.wide;
+  options.readable = !globals.raw && options.format != OutputFormat::kJson;
   Connection connection;
   std::string error;
   if (!ResolveConnection(Environment::Process(), globals.url, globals.token, globals.cacert,
