@@ -48,7 +48,7 @@ void WarnIfPlainOffLoopback(const fw::HttpServer& server, const std::string& add
   int port = 0;
   if (!server.tls() && fw::HttpServer::ParseAddress(address, &host, &port) &&
       !fw::IsLoopbackHost(host)) {
-    fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__,
+    fw::TracePrintfAlways(kUnit, fw::kTraceWarning, __func__,
                           "Warning: the HTTP API on %s is reachable from other hosts over plain "
                           "HTTP: the bearer token and every reply travel in clear. Set "
                           "Q7_TLS_CERT and Q7_TLS_KEY to serve HTTPS.",
@@ -85,7 +85,7 @@ int kunmain(int /*argc*/, char** /*argv*/) {
       fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__, "%s", error.c_str());
     }
   } else {
-    fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__,
+    fw::TracePrintfAlways(kUnit, fw::kTraceWarning, __func__,
                           "no configuration directory: situations are not kept across restarts "
                           "and the API accepts no changes");
   }

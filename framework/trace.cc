@@ -88,8 +88,15 @@ std::shared_ptr<spdlog::logger> MakeStderrLogger() {
 
 thread_local std::string t_thread_name;
 
-// The highest bit set names the record's class; bits without a name show in hex.
+// A label bit names the record; else the highest class bit set does, and bits without a name
+// show in hex.
 std::string ClassLabel(unsigned cls) {
+  if ((cls & kTraceWarning & ~kTraceAll) != 0) {
+    return "WARN";
+  }
+  if ((cls & kTraceInfo & ~kTraceAll) != 0) {
+    return "INFO";
+  }
   for (int bit = 7; bit >= 0; --bit) {
     const unsigned b = 1u << bit;
     if ((cls & b) == 0) {

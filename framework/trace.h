@@ -29,6 +29,13 @@ inline constexpr unsigned kTraceFlow = 0x40;
 inline constexpr unsigned kTraceError = 0x80;
 inline constexpr unsigned kTraceAll = 0xFF;
 
+// Records the agent always writes (enabled and flushed with the error class, so the default mask
+// keeps them) that are not failures. They carry a label bit above the mask's byte, so that
+// `grep ERROR` finds failures only: INFO for what the agent does (processes started, a first
+// start without saved state), WARN for settings that will cause trouble.
+inline constexpr unsigned kTraceInfo = 0x100 | kTraceError;
+inline constexpr unsigned kTraceWarning = 0x200 | kTraceError;
+
 // Parses a Q7_TRACE text and replaces all masks with it (units not named take the "*" mask, or
 // the error class when "*" is not named). A "*" word overrides the units named before it. Class
 // names are matched in any case; a number above 0xFF is a syntax error. On a syntax error returns
@@ -57,8 +64,9 @@ unsigned TraceMask(std::string_view unit);
 // True when any bit of cls is enabled for the unit.
 bool TraceEnabled(std::string_view unit, unsigned cls);
 
-// Writes one record unconditionally. cls names the record's class (the highest bit set wins
-// for the label; bits without a class name show in hex, "0x20"). func may be empty, and then
+// Writes one record unconditionally. cls names the record's class (the label bits of kTraceInfo
+// and kTraceWarning first, else the highest bit set wins for the label; bits without a class
+// name show in hex, "0x20"). func may be empty, and then
 // the record has no "func: " part. Line ends at the end of text are dropped. Error-class
 // records are flushed at once.
 void TraceWrite(std::string_view unit, unsigned cls, std::string_view func, std::string_view text);

@@ -108,6 +108,23 @@ TEST(TraceRecordTest, RecordsCarryThreadUnitClassAndFunction) {
   EXPECT_EQ("[Worker One] runtime 0x20 f: unnamed bit", lines[2]);
 }
 
+// Records always written that are not failures say what they are, and are gated like errors: the
+// default mask keeps them, a unit traced at NONE drops them.
+TEST(TraceRecordTest, InfoAndWarningAreGatedLikeErrorsButNotLabelledSo) {
+  TraceCapture capture("*=ERROR quiet=NONE");
+  TracePrintf("tama", kTraceInfo, "run", "Starting process with command %s", "/bin/sh");
+  TracePrintf("tama", kTraceWarning, "start", "Warning: %s", "path");
+  TracePrintf("quiet", kTraceInfo, "run", "hidden info");
+  TracePrintf("quiet", kTraceWarning, "run", "hidden warning");
+  const std::vector<std::string> lines = capture.lines();
+  ASSERT_EQ(2u, lines.size());
+  EXPECT_NE(std::string::npos,
+            lines[0].find("] tama INFO run: Starting process with command /bin/sh"));
+  EXPECT_NE(std::string::npos, lines[1].find("tama WARN start: Warning: path"));
+  EXPECT_TRUE(TraceEnabled("tama", kTraceInfo));
+  EXPECT_FALSE(TraceEnabled("quiet", kTraceWarning));
+}
+
 // Masks gate TracePrintf and flow events, never the unconditional writers.
 TEST(TraceRecordTest, MasksGateConditionalWriters) {
   TraceCapture capture("*=NONE tama=SUMMARY");

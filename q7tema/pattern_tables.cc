@@ -115,13 +115,13 @@ const char* TraceSituation(const char* where, const fw::Request& request) {
 
 void ReportNothingAdded(const char* situation, const char* const* missing, std::size_t count) {
   fw::TracePrintfAlways(
-      kUnit, fw::kTraceError, __func__,
+      kUnit, fw::kTraceWarning, __func__,
       "Warning: pattern was not added because not all required columns were defined for "
       "sitation %s",
       situation);
   for (std::size_t i = 0; i < count; ++i) {
     if (missing[i] != nullptr) {
-      fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__, "%s", missing[i]);
+      fw::TracePrintfAlways(kUnit, fw::kTraceWarning, __func__, "%s", missing[i]);
     }
   }
 }

@@ -52,12 +52,12 @@ int Agent::run(int argc, char** argv) {
   Q7_FLOW(kUnit);
   const bool noStart = std::getenv("DPX_NOSTART") != nullptr;
   if (noStart) {
-    Q7_TRACE(kUnit, fw::kTraceError,
+    Q7_TRACE(kUnit, fw::kTraceInfo,
              "DPX_NOSTART environment variable found. Will not start DPX processes.");
   }
   if (std::getenv("DPX_ZERORECORDS") != nullptr) {
     CConfig::setReportZeroRecords(true);
-    Q7_TRACE(kUnit, fw::kTraceError,
+    Q7_TRACE(kUnit, fw::kTraceWarning,
              "DPX_ZERORECORDS environment variable found. Will report 0 records for some tables.");
   }
 

@@ -108,7 +108,7 @@ void ServiceMonitor::run() {
       wait();
       continue;
     }
-    Q7_TRACE(kUnit, fw::kTraceError, "Starting process with command %s", startPath);
+    Q7_TRACE(kUnit, fw::kTraceInfo, "Starting process with command %s", startPath);
     ++starts;
     runCommand(startPath, startArgv);
     wait();
@@ -117,7 +117,7 @@ void ServiceMonitor::run() {
   // succeeds: the stop command then runs anyway.
   const long pid = getPID();
   if (kill(static_cast<pid_t>(pid), 0) == 0) {
-    Q7_TRACE(kUnit, fw::kTraceError, "Stopping process with command %s", stopPath);
+    Q7_TRACE(kUnit, fw::kTraceInfo, "Stopping process with command %s", stopPath);
     runCommand(stopPath, stopArgv);
   }
 }

@@ -149,7 +149,7 @@ void* managerThread(void* /*arg*/) {
   pthread_cleanup_push(onCancel, nullptr);
   SignalManager::waitForSignal();
   pthread_cleanup_pop(0);
-  Q7_TRACE(kUnit, fw::kTraceError, "Termination signal received.  Exiting.");
+  Q7_TRACE(kUnit, fw::kTraceInfo, "Termination signal received.  Exiting.");
   fw::RequestShutdown(1);
   return nullptr;
 }

@@ -60,7 +60,7 @@ void applyAgentProperties() {
   if (dpx_path.find_first_of(".-") != std::string::npos) {
     // File order and renamed-file lookup cut names at the first '.' of the whole path and take
     // any '-' in it for the mark of a renamed file.
-    Q7_TRACE(kUnit, fw::kTraceError,
+    Q7_TRACE(kUnit, fw::kTraceWarning,
              "Warning: KQ7DPXLOGPATH \"%s\" contains a '.' or '-'; collector files in it will be "
              "ordered wrongly and renamed files missed. Move the data directory to a path "
              "without them.",

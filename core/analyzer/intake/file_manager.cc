@@ -14,6 +14,7 @@
 #include "framework/atomic_file.h"
 #include "framework/file_io.h"
 #include "framework/status.h"
+#include "framework/trace.h"
 
 CFileManager::CFileManager(const char* threadName) : CvelThread(threadName) {
   setDirToWatch(CConfig::getDpxDataDirectory());
@@ -90,7 +91,10 @@ _LAST_FILE_INFO* CFileManager::getLastProcessedFile() {
   }
   fw::UniqueFd fd(::open(path, O_RDONLY | O_CLOEXEC));
   if (!fd.valid()) {
-    CLOG::error("%s Failed[%d] to open the persist file[%s]", kWhere, errno, path);
+    // No file yet is every first start's normal case, not a failure.
+    const int error = errno;
+    fw::TracePrintfAlways("analyzer", error == ENOENT ? fw::kTraceInfo : fw::kTraceError, "",
+                          "%s Failed[%d] to open the persist file[%s]", kWhere, error, path);
     return nullptr;
   }
   CLOG::max("%s Opened the persist file [%s]", kWhere, path);
