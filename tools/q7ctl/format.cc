@@ -123,6 +123,19 @@ class TableLayout {
     }
   }
 
+  // Drops columns from the right until a line fits max_line characters; returns how many.
+  std::size_t Narrow(std::size_t max_line) {
+    std::size_t dropped = 0;
+    while (columns_.size() > 1 && LineWidth() > max_line) {
+      columns_.pop_back();
+      widths_.pop_back();
+      numbers_.pop_back();
+      texts_.pop_back();
+      ++dropped;
+    }
+    return dropped;
+  }
+
   std::string Header() const {
     std::vector<std::pair<std::string, bool>> cells;
     for (std::size_t i = 0; i < columns_.size(); ++i) {
@@ -142,6 +155,14 @@ class TableLayout {
   }
 
  private:
+  std::size_t LineWidth() const {
+    std::size_t width = 0;
+    for (const std::size_t w : widths_) {
+      width += w;
+    }
+    return width + kColumnGap * (widths_.empty() ? 0 : widths_.size() - 1);
+  }
+
   std::string Text(const Json& value) const {
     std::string text = EscapeControls(CellText(value));
     if (IsNumeric(value) || options_.wide) {
@@ -258,15 +279,15 @@ std::vector<std::string> ColumnsOf(const Json& rows) {
   return columns;
 }
 
-void WriteRows(const Json& rows, const FormatOptions& options, std::ostream& out,
-               const Json& items) {
+std::size_t WriteRows(const Json& rows, const FormatOptions& options, std::ostream& out,
+                      const Json& items) {
   switch (options.format) {
     case OutputFormat::kJson:
       out << Dump(items.is_null() ? rows : items, 2) << '\n';
-      return;
+      return 0;
     case OutputFormat::kCsv: {
       if (rows.empty()) {
-        return;
+        return 0;
       }
       const std::vector<std::string> columns = ColumnsOf(rows);
       // Lines end in LF, not RFC 4180's CRLF: the output goes to Unix pipes and files.
@@ -274,11 +295,11 @@ void WriteRows(const Json& rows, const FormatOptions& options, std::ostream& out
       for (const Json& row : rows) {
         out << CsvLine(columns, row) << '\n';
       }
-      return;
+      return 0;
     }
     case OutputFormat::kTable: {
       if (rows.empty()) {
-        return;
+        return 0;
       }
       TableLayout layout(options);
       for (const Json& row : rows) {
@@ -287,13 +308,15 @@ void WriteRows(const Json& rows, const FormatOptions& options, std::ostream& out
       for (const Json& row : rows) {
         layout.Fit(row);
       }
+      const std::size_t dropped = options.max_line > 0 ? layout.Narrow(options.max_line) : 0;
       out << layout.Header() << '\n';
       for (const Json& row : rows) {
         out << layout.Row(row) << '\n';
       }
-      return;
+      return dropped;
     }
   }
+  return 0;
 }
 
 StreamWriter::StreamWriter(const FormatOptions& options, std::ostream& out)

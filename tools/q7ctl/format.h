@@ -30,6 +30,9 @@ struct FormatOptions {
   std::size_t max_width = 40;
   // Timestamps and percentages in readable forms (readable.h); the caller converts the rows.
   bool readable = false;
+  // Table output: when not 0, columns are dropped from the right until a line fits this many
+  // characters (the first column always stays).
+  std::size_t max_line = 0;
 };
 
 // Parses "table", "json" or "csv".
@@ -48,9 +51,10 @@ std::vector<std::string> ColumnsOf(const Json& rows);
 // Writes rows (a JSON array of objects) in the chosen format: the table with a header row, CSV
 // with a header line, JSON as a pretty array. JSON output writes `items` (the reply's own
 // objects, which may carry more than the rows, such as a table's column list) instead of rows
-// when items is not null. An empty table or CSV prints nothing.
-void WriteRows(const Json& rows, const FormatOptions& options, std::ostream& out,
-               const Json& items = nullptr);
+// when items is not null. An empty table or CSV prints nothing. Returns the number of columns
+// that max_line left out.
+std::size_t WriteRows(const Json& rows, const FormatOptions& options, std::ostream& out,
+                      const Json& items = nullptr);
 
 class TableLayout;
 

@@ -1,12 +1,15 @@
 // q7ctl: the operator's command line for a running q7agent. Each command is one or two calls of
 // the agent's HTTP API; the reply is printed as a table, CSV or JSON.
 
+#include <unistd.h>
+
 #include <CLI/CLI.hpp>
 #include <iostream>
 #include <string>
 #include <vector>
 
 #include "tools/q7ctl/client.h"
+#include "tools/q7ctl/column_sets.h"
 #include "tools/q7ctl/config.h"
 #include "tools/q7ctl/format.h"
 #include "tools/q7ctl/readable.h"
@@ -94,8 +97,16 @@ int Tables(ApiClient& client, const FormatOptions& options) {
   return 0;
 }
 
+// Which of a table's columns `sample` shows: --columns names them, --all asks for every one, and
+// otherwise table output shows the table's default set, fitted to the line width.
+struct ColumnChoice {
+  std::vector<std::string> columns;
+  bool all = false;
+};
+
 int Sample(ApiClient& client, const FormatOptions& options, const std::string& table,
-           const std::vector<std::string>& wheres, std::optional<long> limit) {
+           const std::vector<std::string>& wheres, std::optional<long> limit,
+           const ColumnChoice& choice) {
   Json reply, rows;
   Result result = client.Get(SampleTarget(table, wheres, limit), &reply);
   if (result.ok()) {
@@ -106,8 +117,39 @@ int Sample(ApiClient& client, const FormatOptions& options, const std::string& t
   }
   if (rows.empty()) {
     SayNone(options, "rows");
+    return 0;
   }
-  WriteRows(options.readable ? ReadableRows(rows) : rows, options, std::cout);
+  FormatOptions shown_options = options;
+  Json shown = rows;
+  std::vector<std::string> unknown;
+  const bool defaults = choice.columns.empty() && !choice.all;
+  if (!choice.columns.empty()) {
+    shown = SelectColumns(rows, choice.columns, &unknown);
+    if (!unknown.empty()) {
+      std::string names;
+      for (const std::string& name : ColumnsOf(rows)) {
+        names += (names.empty() ? "" : ",") + name;
+      }
+      std::cerr << "q7ctl: " << table << " has no column \"" << unknown.front()
+                << "\"; its columns: " << names << '\n';
+      return kUsage;
+    }
+  } else if (defaults && options.format == OutputFormat::kTable) {
+    const std::vector<std::string> set = DefaultColumns(table);
+    if (!set.empty()) {
+      shown = SelectColumns(rows, set, &unknown);
+    }
+    shown_options.max_line = kDefaultLineWidth;
+  }
+  const std::size_t hidden =
+      WriteRows(options.readable ? ReadableRows(shown) : shown, shown_options, std::cout);
+  const std::size_t total = ColumnsOf(rows).size();
+  const std::size_t printed = ColumnsOf(shown).size() - hidden;
+  if (defaults && options.format == OutputFormat::kTable && printed < total &&
+      ::isatty(STDERR_FILENO) != 0) {
+    std::cerr << "(" << printed << " of " << total
+              << " columns; --all shows every one, --columns A,B,... chooses)\n";
+  }
   return 0;
 }
 
@@ -272,9 +314,23 @@ int Run(int argc, char** argv) {
       ->multi_option_policy(CLI::MultiOptionPolicy::TakeAll);
   CLI::Option* limit_option =
       sample->add_option("--limit", limit, "At most N rows")->check(CLI::NonNegativeNumber);
+  ColumnChoice column_choice;
+  CLI::Option* columns_option =
+      sample
+          ->add_option("--columns", column_choice.columns,
+                       "Columns to show, in this order, comma-separated (any output format; "
+                       "names in any case)")
+          ->delimiter(',');
+  sample
+      ->add_flag("--all", column_choice.all,
+                 "Every column (table output otherwise shows the table's main columns, "
+                 "trimmed to 120 characters)")
+      ->excludes(columns_option);
   sample->footer(Help(
       "Examples:\n"
       "  q7ctl sample Q7AGNTDTS\n"
+      "  q7ctl sample Q7APPSM --columns applicatin,totreq,pcfail,oatime\n"
+      "  q7ctl sample Q7TXINS --all --wide\n"
       "  q7ctl sample Q7TXSM --where \"APPLICATIN EQ Shop\" --where \"TOTREQ GT 10\" --limit 5\n"
       "  q7ctl sample Q7TXSM -o csv > q7txsm.csv"));
 
@@ -361,7 +417,8 @@ int Run(int argc, char** argv) {
   }
   if (sample->parsed()) {
     return Sample(client, options, table, wheres,
-                  limit_option->count() > 0 ? std::optional<long>(limit) : std::nullopt);
+                  limit_option->count() > 0 ? std::optional<long>(limit) : std::nullopt,
+                  column_choice);
   }
   if (latency->parsed()) {
     return Latency(client, options, by, window, latency_wheres);
