@@ -26,7 +26,7 @@ DEPS := cmake ninja-build g++ make pkg-config git curl \
         libssl-dev zlib1g-dev libbrotli-dev libicu-dev icu-devtools \
         libcpp-httplib-dev nlohmann-json3-dev libspdlog-dev libfmt-dev \
         libcli11-dev libinih-dev clang libclang-rt-14-dev \
-        libpcap-dev tshark tcpdump nginx-light pcapfix python3-dpkt goaccess prometheus
+        libpcap-dev tshark tcpdump nginx-light pcapfix python3-dpkt goaccess prometheus tmux
 
 SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
 

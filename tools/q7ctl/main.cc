@@ -13,6 +13,7 @@
 #include "tools/q7ctl/config.h"
 #include "tools/q7ctl/format.h"
 #include "tools/q7ctl/readable.h"
+#include "tools/q7ctl/top.h"
 
 namespace q7ctl {
 namespace {
@@ -32,6 +33,7 @@ Examples:
   q7ctl tables
   q7ctl sample Q7TXSM --where "APPLICATIN EQ Shop" -o csv
   q7ctl latency --by transaction
+  q7ctl top
   q7ctl situation start Shop --table Q7TXPTNS APPLICATIN=Shop APPPATTERN='*' \
         TRANSACTN=Checkout TRANSPATTN='*/checkout*'
   q7ctl events --follow
@@ -360,6 +362,27 @@ int Run(int argc, char** argv) {
       "  q7ctl latency --by transaction --where \"application EQ Shop\" --where \"p95_ms GT 500\"\n"
       "  q7ctl latency --window interval -o csv"));
 
+  CLI::App* top = app.add_subcommand(
+      "top", "Live view of the busiest or slowest applications and transactions");
+  TopOptions top_options;
+  top->add_option("-n,--interval", top_options.interval_seconds, "Seconds between refreshes")
+      ->check(CLI::Range(0.1, 3600.0))
+      ->capture_default_str();
+  top->add_flag("--summary", top_options.view.summary,
+                "Start on the summary period instead of the current interval (key w)");
+  top->add_flag("--slowest", top_options.view.slowest,
+                "Start with the slowest first (by p95) instead of the busiest (key s)");
+  top->add_flag("--once", top_options.once,
+                "Print one screen and exit (also what happens when the output is not a "
+                "terminal)");
+  top->footer(
+      Help("Keys: w switches between the current interval and the summary period, s between\n"
+           "busiest and slowest first, q (or Ctrl-C) quits; any other key refreshes at once.\n"
+           "Examples:\n"
+           "  q7ctl top\n"
+           "  q7ctl top --summary --slowest -n 5\n"
+           "  q7ctl top --once > snapshot.txt"));
+
   CLI::App* situation = app.add_subcommand("situation", "List, start or stop situations");
   situation->require_subcommand(1);
   CLI::App* list = situation->add_subcommand("list", "List the started situations");
@@ -422,6 +445,9 @@ int Run(int argc, char** argv) {
   }
   if (latency->parsed()) {
     return Latency(client, options, by, window, latency_wheres);
+  }
+  if (top->parsed()) {
+    return RunTop(client, connection.url, top_options);
   }
   if (list->parsed()) {
     return SituationList(client, options);
