@@ -126,7 +126,9 @@ TEST(TvelQueueTest, PutBatchStoresWhatPutWould) {
     _TYPED_TRANSACTION out[9];
     uint32_t expected = 0;
     while (expected < kItems) {
-      const long taken = queue.GetBatch(out, 1 + std::rand() % 9, 1000);
+      // A loaded machine may starve this thread for seconds; a timeout here would leave the
+      // producer blocked on the full queue for good.
+      const long taken = queue.GetBatch(out, 1 + std::rand() % 9, 60000);
       ASSERT_GT(taken, 0);
       for (long i = 0; i < taken; ++i) {
         ASSERT_EQ(expected++, out[i].type);
