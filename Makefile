@@ -6,6 +6,7 @@
 #   make demo     build, lay out a demo home in demo-home/ and run the agent in the foreground
 #   make bench    Release build of the benchmarks, then run them
 #   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/
+#   make deb      Release build in build-deb/, then its Debian package (CPack)
 #   make asan / make tsan   sanitizer builds with their unit tests (asan: clang, with the
 #                           thread-safety analysis)
 #   make test-tsan          the concurrency tests (runtime, situations, analyzer) under TSan
@@ -26,12 +27,13 @@ DEPS := cmake ninja-build g++ make pkg-config git curl \
         libssl-dev zlib1g-dev libbrotli-dev libicu-dev icu-devtools \
         libcpp-httplib-dev nlohmann-json3-dev libspdlog-dev libfmt-dev \
         libcli11-dev libinih-dev clang libclang-rt-14-dev \
-        libpcap-dev tshark tcpdump nginx-light pcapfix python3-dpkt goaccess prometheus tmux
+        libpcap-dev tshark tcpdump nginx-light pcapfix python3-dpkt goaccess prometheus tmux \
+        dpkg-dev adduser
 
 SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
 
-.PHONY: all deps build test test-tsan demo bench load install asan tsan fuzz fuzz-build fuzz-smoke \
-        fuzz-smoke-run soak \
+.PHONY: all deps build test test-tsan demo bench load install deb asan tsan fuzz fuzz-build \
+        fuzz-smoke fuzz-smoke-run soak \
         clean format
 
 all: build
@@ -172,6 +174,16 @@ install: build
 	@echo "Live capture (sm3ctl.conf MODE=capture) needs CAP_NET_RAW: run the agent as root, or give"
 	@echo "sm3capture the capability once: setcap cap_net_raw,cap_net_admin=eip $(PREFIX)/bin/sm3capture"
 
+# The package's programs come from a build of their own, without tests or benchmarks; cpack
+# prints its progress, the last line names the package.
+deb: deps
+	cmake -S . -B build-deb $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Release -DQ7_BUILD_TESTS=OFF \
+	  -DQ7_BUILD_BENCH=OFF
+	cmake --build build-deb -j $(JOBS)
+	rm -f build-deb/q7agent_*.deb
+	cd build-deb && cpack -G DEB
+	@echo "Debian package: $$(ls $(CURDIR)/build-deb/q7agent_*.deb)"
+
 DEMO_HOME ?= $(CURDIR)/demo-home
 demo: build
 	@resources/demo.sh --check "$(DEMO_HOME)"
@@ -183,4 +195,4 @@ format:
 	clang-format -i $$(git ls-files '*.h' '*.cc')
 
 clean:
-	rm -rf build build-asan build-tsan build-release build-fuzz
+	rm -rf build build-asan build-tsan build-release build-fuzz build-deb
