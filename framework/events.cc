@@ -36,14 +36,11 @@ EventHub& Hub() {
 
 }  // namespace
 
-int PushEventRows(std::string_view table, const void* rows, std::size_t row_size, int count) {
-  if (table.empty() || rows == nullptr || row_size == 0 || count < 1) {
-    return kInvalidArgument;
-  }
-  EventHub& hub = Hub();
-  MutexLock lock(hub.mutex);
-  std::deque<EventRow>& ring = hub.rings[Key(table)];
-  // Drop subscriptions whose owners are gone before delivering to the rest.
+namespace {
+
+// The subscriptions still open, after dropping those whose owners are gone.
+std::vector<std::shared_ptr<EventSubscription>> LiveSubscriptions(EventHub& hub)
+    REQUIRES(hub.mutex) {
   std::vector<std::shared_ptr<EventSubscription>> live;
   std::erase_if(hub.subscriptions, [&](const std::weak_ptr<EventSubscription>& weak) {
     std::shared_ptr<EventSubscription> subscription = weak.lock();
@@ -53,6 +50,27 @@ int PushEventRows(std::string_view table, const void* rows, std::size_t row_size
     live.push_back(std::move(subscription));
     return false;
   });
+  return live;
+}
+
+// Keeps a delivered row in its table's ring, the oldest beyond the capacity dropped.
+void Keep(EventHub& hub, EventRow row) REQUIRES(hub.mutex) {
+  std::deque<EventRow>& ring = hub.rings[Key(row.table)];
+  ring.push_back(std::move(row));
+  if (ring.size() > kEventRingCapacity) {
+    ring.pop_front();
+  }
+}
+
+}  // namespace
+
+int PushEventRows(std::string_view table, const void* rows, std::size_t row_size, int count) {
+  if (table.empty() || rows == nullptr || row_size == 0 || count < 1) {
+    return kInvalidArgument;
+  }
+  EventHub& hub = Hub();
+  MutexLock lock(hub.mutex);
+  const std::vector<std::shared_ptr<EventSubscription>> live = LiveSubscriptions(hub);
   const auto* bytes = static_cast<const std::byte*>(rows);
   for (int i = 0; i < count; ++i) {
     EventRow row;
@@ -63,11 +81,25 @@ int PushEventRows(std::string_view table, const void* rows, std::size_t row_size
     for (const auto& subscription : live) {
       subscription->Deliver(row);
     }
-    ring.push_back(std::move(row));
-    if (ring.size() > kEventRingCapacity) {
-      ring.pop_front();
-    }
+    Keep(hub, std::move(row));
   }
+  return kOk;
+}
+
+int PushEventJson(std::string_view stream, nlohmann::ordered_json event) {
+  if (stream.empty() || !event.is_object()) {
+    return kInvalidArgument;
+  }
+  EventHub& hub = Hub();
+  MutexLock lock(hub.mutex);
+  EventRow row;
+  row.table = std::string(stream);
+  row.sequence = ++hub.last_sequence;
+  row.json = std::move(event);
+  for (const auto& subscription : LiveSubscriptions(hub)) {
+    subscription->Deliver(row);
+  }
+  Keep(hub, std::move(row));
   return kOk;
 }
 

@@ -16,6 +16,7 @@
 #include <cstdint>
 #include <deque>
 #include <memory>
+#include <nlohmann/json.hpp>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -27,11 +28,12 @@ namespace fw {
 // Rows kept per event table, and rows a subscription buffers before it drops the oldest.
 inline constexpr std::size_t kEventRingCapacity = 1000;
 
-// One pushed row.
+// One pushed row, or an event that is no table's row (an alert change) as JSON.
 struct EventRow {
-  std::string table;             // the table's name as pushed ("Q7AGNTMSGS")
+  std::string table;             // the table's name as pushed ("Q7AGNTMSGS"), or the stream's
   std::uint64_t sequence = 0;    // order of pushes over all tables, from 1
-  std::vector<std::byte> bytes;  // one row of the table's layout
+  std::vector<std::byte> bytes;  // one row of the table's layout; empty for a JSON event
+  nlohmann::ordered_json json;   // the event of a JSON stream; null for a row
 };
 
 // Copies count rows of row_size bytes at rows into the ring of table, evicting the oldest rows
@@ -39,6 +41,14 @@ struct EventRow {
 // kInvalidArgument (and keeps nothing) for an empty table name, null rows, a zero row size or
 // a count below 1.
 int PushEventRows(std::string_view table, const void* rows, std::size_t row_size, int count);
+
+// The name of the JSON stream of alert changes (alert_sampler.h).
+inline constexpr char kAlertEventStream[] = "alerts";
+
+// Keeps an event that is no table's row (a JSON object) in the ring of `stream` and hands it to
+// every open subscription, numbered with the rows. kInvalidArgument for an empty stream name or
+// an event that is not an object.
+int PushEventJson(std::string_view stream, nlohmann::ordered_json event);
 
 // The rows kept for table, oldest first; empty for a table that never had an event.
 std::vector<EventRow> ListEventRows(std::string_view table);
@@ -65,6 +75,7 @@ class EventSubscription {
  private:
   friend std::shared_ptr<EventSubscription> SubscribeEvents();
   friend int PushEventRows(std::string_view, const void*, std::size_t, int);
+  friend int PushEventJson(std::string_view, nlohmann::ordered_json);
   EventSubscription() = default;
   void Deliver(const EventRow& row);
 

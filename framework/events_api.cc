@@ -63,6 +63,9 @@ std::string Dump(const nlohmann::ordered_json& body, int indent) {
 // The row as a table sample shows it; nullopt when its table is not registered or the row is
 // not of the table's size.
 std::optional<nlohmann::ordered_json> RowToJson(const EventRow& row) {
+  if (!row.json.is_null()) {
+    return row.json;
+  }
   Sample sample;
   sample.table = FindTable(row.table);
   if (sample.table == nullptr || sample.table->row_size != row.bytes.size()) {
@@ -130,7 +133,9 @@ void ServeStream(const std::shared_ptr<StreamControl>& control, httplib::Respons
         std::string chunk;
         if (subscription->Next(&row, kStreamPoll)) {
           if (auto json = RowToJson(row)) {
-            chunk = "data: " + Dump(*json, -1) + "\n\n";
+            // Alert changes are named, so a browser's EventSource can listen for them apart.
+            chunk = (row.json.is_null() ? "" : "event: " + row.table + "\n") +
+                    "data: " + Dump(*json, -1) + "\n\n";
           }
         } else if (subscription->closed()) {
           sink.done();

@@ -6,8 +6,9 @@
 //   GET /api/v1/events/stream   server-sent events, one "data: row\n\n" per row pushed from now
 //
 // A row is a JSON object keyed by attribute name, text without its padding, as in table
-// samples. Each open stream holds one of the server's worker threads, so at most
-// kMaxEventStreams are served at once; more are refused with 503.
+// samples. Alert changes come among them as the alert book's objects ("kind": "raised" or
+// "cleared"), named "event: alerts" in the stream. Each open stream holds one of the server's
+// worker threads, so at most kMaxEventStreams are served at once; more are refused with 503.
 //
 // Thread safety: InstallEventRoutes and EndEventStreams run on the thread that starts and stops
 // the server; the handlers run on its worker threads.

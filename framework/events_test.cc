@@ -126,7 +126,9 @@ class EventsEndpointTest : public EventsTest {
                           {{"text", kColumnTypeString, 8, 0},
                            {"number", kColumnTypeInt32, 4, static_cast<int>(sizeof(char[8]))}},
                           sizeof(Note),
-                          std::make_unique<NullManager>()};
+                          std::make_unique<NullManager>(),
+                          {},
+                          false};
     ASSERT_EQ(kOk, RegisterTable(std::move(table)));
     std::string error;
     ASSERT_EQ(kOk, server_.Start("127.0.0.1:0", &error)) << error;

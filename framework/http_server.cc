@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "framework/agent_runtime.h"
+#include "framework/alerts_api.h"
 #include "framework/api_token.h"
 #include "framework/events_api.h"
 #include "framework/http_json.h"
@@ -249,6 +250,9 @@ void HttpServer::InstallRoutes(bool loopback) {
   InstallSituationRoutes(s);
   InstallEventRoutes(s);
   InstallMetricsRoutes(s);
+  if (alerts_ != nullptr) {
+    InstallAlertRoutes(s, alerts_);
+  }
 }
 
 int HttpServer::Start(const std::string& address, std::string* error) {

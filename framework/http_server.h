@@ -17,6 +17,8 @@ class Server;
 
 namespace fw {
 
+class AlertBook;
+
 class HttpServer {
  public:
   HttpServer();
@@ -41,6 +43,9 @@ class HttpServer {
   }
   bool tls() const { return !tls_certificate_.empty(); }
 
+  // Serves GET /api/v1/alerts from the book, which must outlive the server. Call before Start.
+  void ServeAlerts(const AlertBook* book) { alerts_ = book; }
+
   // Stops serving and waits for requests in flight. Safe to call when not started.
   void Stop();
 
@@ -59,6 +64,7 @@ class HttpServer {
   std::string api_token_;  // set before Start, then read by the pool threads
   std::string tls_certificate_;
   std::string tls_key_;
+  const AlertBook* alerts_ = nullptr;  // null: no alerts endpoint
 };
 
 }  // namespace fw

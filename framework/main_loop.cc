@@ -2,12 +2,16 @@
 
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
 #include <string>
+#include <vector>
 
 #include "framework/agent_runtime.h"
+#include "framework/alert_book.h"
+#include "framework/alert_sampler.h"
 #include "framework/api_token.h"
 #include "framework/atomic_file.h"
 #include "framework/environment.h"
@@ -56,6 +60,20 @@ void WarnIfPlainOffLoopback(const fw::HttpServer& server, const std::string& add
   }
 }
 
+// Situations stopped, or dropped from the list, while the agent was down: their open alerts
+// clear now rather than stay open for good.
+void ForgetStoppedAlertSituations(const fw::AlertBook& alerts, fw::AlertSampler* sampler) {
+  const std::vector<fw::SituationInfo> started = fw::ListSituations();
+  for (const std::string& name : alerts.Situations()) {
+    const bool alerting = std::any_of(started.begin(), started.end(), [&](const auto& info) {
+      return info.name == name && info.alert.has_value();
+    });
+    if (!alerting) {
+      sampler->SituationStopped(name);
+    }
+  }
+}
+
 }  // namespace
 
 int kunmain(int /*argc*/, char** /*argv*/) {
@@ -75,11 +93,24 @@ int kunmain(int /*argc*/, char** /*argv*/) {
   std::string error;
   std::string config_dir;
   std::string token;
-  if (fw::GetConfigDirectory(&config_dir) == fw::kOk) {
+  const bool has_config = fw::GetConfigDirectory(&config_dir) == fw::kOk;
+  if (has_config) {
     ::mkdir(config_dir.c_str(), 0755);  // a first start in a fresh home
+  }
+  // Alerts: situations on row tables are sampled by the sampler, which the situations tell of
+  // every start and stop; open alerts and recent changes are kept in the book's file.
+  fw::AlertBook alerts(has_config ? config_dir + "q7_alerts.json" : "");
+  if (alerts.Load(&error) != fw::kOk) {
+    fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__, "%s", error.c_str());
+  }
+  fw::WebhookSender webhooks;
+  fw::AlertSampler sampler(&alerts, &webhooks);
+  fw::SetSituationListener(&sampler);
+  if (has_config) {
     fw::SetSituationsFile(config_dir + "q7_situations.json");
     const int restored = fw::RestoreSituations();
     Q7_TRACE(kUnit, fw::kTraceSummary, "%d situations restored", restored);
+    ForgetStoppedAlertSituations(alerts, &sampler);
     if (fw::LoadOrCreateApiToken(config_dir + "q7_api_token", &token, &error) != fw::kOk) {
       // Reading still works on a loopback address; changes are refused until this is fixed.
       fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__, "%s", error.c_str());
@@ -94,8 +125,10 @@ int kunmain(int /*argc*/, char** /*argv*/) {
   if (!fw::GetEnv("Q7_HTTP_ADDRESS", &address) || address.empty()) {
     address = kDefaultHttpAddress;
   }
+  sampler.Start();
   fw::HttpServer server;
   server.SetApiToken(token);
+  server.ServeAlerts(&alerts);
   std::string address_file;
   std::string certificate;
   std::string key;
@@ -138,7 +171,10 @@ int kunmain(int /*argc*/, char** /*argv*/) {
   if (!address_file.empty()) {
     std::remove(address_file.c_str());
   }
-  // Stopping the agent never stops a situation: drop them without their destructors.
+  // Stopping the agent never stops a situation: drop them without their destructors. Open
+  // alerts stay open in their file for the next start.
   fw::ResetSituations();
+  sampler.Stop();
+  webhooks.Stop();
   return 0;
 }

@@ -22,6 +22,7 @@
 #include "framework/table_manager.h"
 #include "framework/tables.h"
 #include "framework/trace.h"
+#include "framework/webhook_sender.h"
 
 namespace fw {
 namespace {
@@ -41,6 +42,7 @@ struct Registry {
   Mutex mutex;
   std::vector<Started> started GUARDED_BY(mutex);  // in the order started
   std::string file GUARDED_BY(mutex);              // where the list is persisted; empty: nowhere
+  SituationListener* listener GUARDED_BY(mutex) = nullptr;
 };
 
 Registry& TheRegistry() {
@@ -127,7 +129,75 @@ nlohmann::ordered_json SituationToJson(const SituationInfo& info) {
     conditions.push_back(
         {{"column", c.column}, {"op", std::string(ConditionOpName(c.op))}, {"value", c.value}});
   }
-  return {{"name", info.name}, {"table", info.table}, {"conditions", std::move(conditions)}};
+  nlohmann::ordered_json json = {
+      {"name", info.name}, {"table", info.table}, {"conditions", std::move(conditions)}};
+  if (info.alert.has_value()) {
+    json["every"] = info.alert->every;
+    json["for"] = info.alert->for_count;
+    json["severity"] = info.alert->severity;
+    json["webhook"] = info.alert->webhook;
+  }
+  return json;
+}
+
+int ParseAlertSettings(const nlohmann::json& item, const TableDefinition& table,
+                       std::optional<AlertSettings>* out, std::string* error) {
+  static constexpr const char* kFields[] = {"every", "for", "severity", "webhook"};
+  if (table.defines_patterns) {
+    for (const char* field : kFields) {
+      if (item.contains(field)) {
+        *error = std::string("\"") + field + "\" is for alerts, and " + table.name +
+                 " defines patterns: alerts sample a row table";
+        return kInvalidArgument;
+      }
+    }
+    out->reset();
+    return kOk;
+  }
+  AlertSettings settings;
+  for (const auto& [field, target] :
+       {std::pair<const char*, int*>{"every", &settings.every}, {"for", &settings.for_count}}) {
+    if (!item.contains(field)) {
+      continue;
+    }
+    const nlohmann::json& value = item[field];
+    if (!value.is_number_integer() || value.get<long long>() < 1 ||
+        value.get<long long>() > 86400) {
+      *error = std::string("\"") + field + "\" must be a whole number from 1 to 86400" +
+               (std::string(field) == "every" ? " (seconds)" : " (samples)");
+      return kInvalidArgument;
+    }
+    *target = static_cast<int>(value.get<long long>());
+  }
+  if (item.contains("severity")) {
+    if (!item["severity"].is_string() || item["severity"].get<std::string>().empty() ||
+        item["severity"].get<std::string>().size() > kMaxSeverityLength) {
+      *error = "\"severity\" must be a text of 1 to " + std::to_string(kMaxSeverityLength) +
+               " characters";
+      return kInvalidArgument;
+    }
+    settings.severity = item["severity"].get<std::string>();
+  }
+  if (item.contains("webhook") &&
+      !(item["webhook"].is_string() && item["webhook"].get<std::string>().empty())) {
+    WebhookUrl url;
+    if (!item["webhook"].is_string() ||
+        !ParseWebhookUrl(item["webhook"].get<std::string>(), &url, error)) {
+      if (!item["webhook"].is_string()) {
+        *error = "\"webhook\" must be a text, an http:// or https:// URL";
+      }
+      return kInvalidArgument;
+    }
+    settings.webhook = item["webhook"].get<std::string>();
+  }
+  *out = std::move(settings);
+  return kOk;
+}
+
+void SetSituationListener(SituationListener* listener) {
+  Registry& registry = TheRegistry();
+  MutexLock lock(registry.mutex);
+  registry.listener = listener;
 }
 
 int CheckSituation(std::string_view name, std::string_view table_name,
@@ -200,6 +270,7 @@ int StartSituation(SituationInfo info, bool* replaced, std::string* error) {
   }
   Q7_TRACE(kUnit, kTraceSummary, "starting situation %s on %s with %zu conditions",
            fresh.info.name.c_str(), table->name.c_str(), fresh.info.conditions.size());
+  const std::string name = fresh.info.name;
   fresh.agent->TakeSampleConstructor();
   *replaced = false;
   for (Started& s : registry.started) {
@@ -212,6 +283,13 @@ int StartSituation(SituationInfo info, bool* replaced, std::string* error) {
   if (!*replaced) {
     registry.started.push_back(std::move(fresh));
   }
+  if (registry.listener != nullptr) {
+    for (const Started& s : registry.started) {
+      if (s.info.name == name) {
+        registry.listener->SituationStarted(s.info);
+      }
+    }
+  }
   return Persist(registry, error);
 }
 
@@ -223,7 +301,11 @@ int StopSituation(std::string_view name, std::string* error) {
       Q7_TRACE(kUnit, kTraceSummary, "stopping situation %s on %s", it->info.name.c_str(),
                it->info.table.c_str());
       it->agent->TakeSampleDestructor();
+      const std::string stopped = it->info.name;
       registry.started.erase(it);
+      if (registry.listener != nullptr) {
+        registry.listener->SituationStopped(stopped);
+      }
       return Persist(registry, error);
     }
   }
@@ -290,7 +372,8 @@ int RestoreSituations() {
     SituationInfo info;
     std::string error;
     if (CheckSituation(item["name"].get<std::string>(), item["table"].get<std::string>(),
-                       conditions, &info, &error) != kOk) {
+                       conditions, &info, &error) != kOk ||
+        ParseAlertSettings(item, *FindTable(info.table), &info.alert, &error) != kOk) {
       Q7_TRACE(kUnit, kTraceError, "%s: not restoring situation %s: %s", registry.file.c_str(),
                item["name"].get<std::string>().c_str(), error.c_str());
       continue;
@@ -311,6 +394,9 @@ int RestoreSituations() {
     Q7_TRACE(kUnit, kTraceSummary, "restored situation %s on %s", s.info.name.c_str(),
              s.info.table.c_str());
     registry.started.push_back(std::move(s));
+    if (registry.listener != nullptr) {
+      registry.listener->SituationStarted(registry.started.back().info);
+    }
   }
   return static_cast<int>(restored.size());
 }
@@ -320,6 +406,7 @@ void ResetSituations() {
   MutexLock lock(registry.mutex);
   registry.started.clear();
   registry.file.clear();
+  registry.listener = nullptr;
 }
 
 }  // namespace fw

@@ -2,7 +2,8 @@
 
 // Situations: named, long-lived requests on a table. Starting one hands its conditions to the
 // table's agent object as a request of type 4 (TakeSampleConstructor); stopping it calls
-// TakeSampleDestructor. On the pattern tables this is how operators define patterns.
+// TakeSampleDestructor. On the pattern tables this is how operators define patterns; on row
+// tables a situation alerts (alert_sampler.h), told through the SituationListener.
 //
 // The started situations are persisted, in the order they were started, in
 // <configdir>q7_situations.json (written to a temporary file, then renamed). At the next start
@@ -19,19 +20,56 @@
 #include <vector>
 
 #include "framework/request.h"
+#include "framework/tables.h"
 
 namespace fw {
 
-// A situation as started: its name, table (as the registry spells it) and conditions.
+// How a situation on a row table alerts: the framework samples the table with the situation's
+// conditions every `every` seconds, and a row key that matched in `for_count` consecutive
+// samples raises an alert of this severity, POSTed to the webhook when there is one.
+struct AlertSettings {
+  int every = 60;
+  int for_count = 1;
+  std::string severity = "warning";
+  std::string webhook;  // http(s) URL; empty: none
+};
+
+// A situation as started: its name, table (as the registry spells it) and conditions; alert
+// settings for a situation on a row table, none on a table that defines patterns.
 struct SituationInfo {
   std::string name;
   std::string table;
   std::vector<Condition> conditions;
+  std::optional<AlertSettings> alert;
 };
 
-// {"name": ..., "table": ..., "conditions": [{"column", "op", "value"}, ...]}, as the API
-// shows a situation and the situations file keeps it.
+// {"name": ..., "table": ..., "conditions": [{"column", "op", "value"}, ...]} and, for an
+// alerting situation, "every", "for", "severity" and "webhook": as the API shows a situation
+// and the situations file keeps it.
 nlohmann::ordered_json SituationToJson(const SituationInfo& info);
+
+// The shortest interval between samples of an alerting situation, and the longest severity.
+inline constexpr int kMinAlertEvery = 1;
+inline constexpr std::size_t kMaxSeverityLength = 32;
+
+// Reads "every", "for", "severity" and "webhook" of a situation's JSON (the API's body or the
+// situations file's entry) for its table: a row table always alerts (defaults for what is
+// absent); a table that defines patterns takes none of them. Returns kOk with *out set (nullopt
+// for a pattern table), or kInvalidArgument with *error naming the problem.
+int ParseAlertSettings(const nlohmann::json& item, const TableDefinition& table,
+                       std::optional<AlertSettings>* out, std::string* error);
+
+// Told of every start and stop, under the registry's lock: it must not call back into the
+// situation functions. Set by the main loop before the API starts.
+class SituationListener {
+ public:
+  virtual ~SituationListener() = default;
+  virtual void SituationStarted(const SituationInfo& info) = 0;
+  virtual void SituationStopped(const std::string& name) = 0;
+};
+
+// Null: nobody is told.
+void SetSituationListener(SituationListener* listener);
 
 // The longest situation name.
 inline constexpr std::size_t kMaxSituationNameLength = 64;
@@ -67,12 +105,13 @@ std::vector<SituationInfo> ListSituations();
 void SetSituationsFile(const std::string& path);
 
 // Reads the persisted list and keeps each situation as started, creating its agent object
-// without running it. Situations whose table is unknown are dropped with a trace. A file that
-// does not parse is traced, kept aside as "<file>.bad" and nothing is restored. Returns how
-// many situations were restored.
+// without running it (the listener is told of each). Situations whose table is unknown are dropped
+// with a trace. A file that does not parse is traced, kept aside as "<file>.bad" and nothing is
+// restored. Returns how many situations were restored.
 int RestoreSituations();
 
-// Drops every situation without stopping it, and forgets the file (tests and shutdown).
+// Drops every situation without stopping it, and forgets the file and the listener (tests and
+// shutdown).
 void ResetSituations();
 
 }  // namespace fw

@@ -9,6 +9,7 @@
 #include "framework/http_json.h"
 #include "framework/situations.h"
 #include "framework/status.h"
+#include "framework/tables.h"
 
 namespace fw {
 namespace {
@@ -16,10 +17,12 @@ namespace {
 // The name part of the paths: anything up to the next '/', checked by CheckSituation.
 constexpr char kNamedPath[] = R"(/api/v1/situations/([^/]+))";
 
-// Reads the body of a PUT into table and conditions; false with *error naming the problem.
-bool ParseBody(const std::string& body, std::string* table, std::vector<ConditionText>* conditions,
-               std::string* error) {
-  const nlohmann::json json = nlohmann::json::parse(body, nullptr, false);
+// Reads the body of a PUT into *json, table and conditions; false with *error naming the
+// problem.
+bool ParseBody(const std::string& body, nlohmann::json* parsed, std::string* table,
+               std::vector<ConditionText>* conditions, std::string* error) {
+  *parsed = nlohmann::json::parse(body, nullptr, false);
+  const nlohmann::json& json = *parsed;
   if (json.is_discarded()) {
     *error = "the body is not valid JSON";
     return false;
@@ -78,16 +81,17 @@ void List(const httplib::Request&, httplib::Response& res) {
 
 void Start(const httplib::Request& req, httplib::Response& res) {
   const std::string name = req.matches[1];
+  nlohmann::json json;
   std::string table;
   std::vector<ConditionText> conditions;
   std::string error;
-  if (!ParseBody(req.body, &table, &conditions, &error)) {
+  if (!ParseBody(req.body, &json, &table, &conditions, &error)) {
     ReplyError(res, 400, error);
     return;
   }
   SituationInfo info;
-  const int checked = CheckSituation(name, table, conditions, &info, &error);
-  if (checked != kOk) {
+  if (CheckSituation(name, table, conditions, &info, &error) != kOk ||
+      ParseAlertSettings(json, *FindTable(info.table), &info.alert, &error) != kOk) {
     ReplyError(res, 400, error);
     return;
   }

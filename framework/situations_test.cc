@@ -64,7 +64,9 @@ class SituationsTest : public ::testing::Test {
                                                   {"aggapsuniq", kColumnTypeInt16, 2, 20},
                                                   {"mrtthres", kColumnTypeInt32, 4, 24}},
                                                  28,
-                                                 std::make_unique<RecordingManager>()}));
+                                                 std::make_unique<RecordingManager>(),
+                                                 {},
+                                                 false}));
     file_ = dir_.file("q7_situations.json");
     SetSituationsFile(file_);
   }

@@ -26,7 +26,7 @@ void Sample::Truncate(std::size_t count) {
 }
 
 int SampleTable(std::string_view table, std::vector<Condition> conditions, Sample* sample,
-                std::string* error, std::size_t limit) {
+                std::string* error, std::size_t limit, std::optional<std::string> situation) {
   std::shared_ptr<const TableDefinition> definition = FindTable(table);
   if (definition == nullptr) {
     *error = "no table named " + std::string(table);
@@ -45,6 +45,7 @@ int SampleTable(std::string_view table, std::vector<Condition> conditions, Sampl
 
   Request request;
   request.type = kSampleRequestType;
+  request.situation = std::move(situation);
   request.conditions = conditions;
   request.row_limit = limit;
   {

@@ -9,6 +9,7 @@
 
 #include <cstddef>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -43,8 +44,9 @@ struct Sample {
 // condition holds, the first limit of them at most. Returns kOk and fills *sample; kNotFound when
 // no such table is registered; kInvalidArgument when a condition names a column the table does not
 // have, the manager made no agent object, or the agent object handed over rows of another size than
-// the table's. *error says why on failure.
+// the table's. *error says why on failure. A situation's sample carries its name in the request.
 int SampleTable(std::string_view table, std::vector<Condition> conditions, Sample* sample,
-                std::string* error, std::size_t limit = kNoRowLimit);
+                std::string* error, std::size_t limit = kNoRowLimit,
+                std::optional<std::string> situation = std::nullopt);
 
 }  // namespace fw

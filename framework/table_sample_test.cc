@@ -104,7 +104,9 @@ class TableSampleTest : public ::testing::Test {
                            {"note", kColumnTypeLongText, 12, Offset(offsetof(FakeRow, note))},
                            {"count", kColumnTypeInt32, 4, Offset(offsetof(FakeRow, count))}},
                           sizeof(FakeRow),
-                          std::make_unique<FakeManager>()};
+                          std::make_unique<FakeManager>(),
+                          {},
+                          false};
     ASSERT_EQ(kOk, RegisterTable(std::move(table)));
   }
   void TearDown() override { ResetTablesForTesting(); }
@@ -366,8 +368,8 @@ TEST_F(SampleEndpointTest, LargeSamplesArriveWhole) {
   fake.rows.clear();
   for (int i = 0; i < 1500; ++i) {
     const std::string name = "row" + std::to_string(i);
-    fake.rows.push_back(Row(name.c_str(), static_cast<std::int16_t>(i % 100),
-                            i % 7 == 0 ? "q\"uote" : "", i));
+    fake.rows.push_back(
+        Row(name.c_str(), static_cast<std::int16_t>(i % 100), i % 7 == 0 ? "q\"uote" : "", i));
   }
   Sample sample;
   std::string error;

@@ -41,6 +41,11 @@ struct TableDefinition {
   std::vector<ColumnInfo> columns;        // in row order
   std::size_t row_size = 0;               // bytes per row
   std::unique_ptr<TableManager> manager;  // the table's manager, owned by the registry
+  // The columns whose values tell rows apart for alerts (applicatin; applicatin, transactn,
+  // client and server ...), in this order. Empty: every text column.
+  std::vector<std::string> key_columns;
+  // A situation on the table defines patterns (its start registers them) instead of alerting.
+  bool defines_patterns = false;
 };
 
 // Registers a table after the ones registered before. Returns kOk; kInvalidArgument for an

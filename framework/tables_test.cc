@@ -26,7 +26,7 @@ class NullManager : public TableManager {
 TableDefinition Table(const std::string& name,
                       std::vector<ColumnInfo> columns = {{"text", kColumnTypeString, 6, 0},
                                                          {"count", kColumnTypeInt32, 4, 8}}) {
-  return TableDefinition{name, std::move(columns), 12, std::make_unique<NullManager>()};
+  return TableDefinition{name, std::move(columns), 12, std::make_unique<NullManager>(), {}, false};
 }
 
 class TablesTest : public ::testing::Test {
@@ -69,7 +69,8 @@ TEST_F(TablesTest, RefusesUnusableDefinitions) {
   EXPECT_EQ(kInvalidArgument, RegisterTable(Table("PAST", {{"text", kColumnTypeString, 13, 0}})));
   EXPECT_EQ(kInvalidArgument, RegisterTable(Table("WIDE", {{"n", kColumnTypeInt32, 2, 0}})));
   EXPECT_EQ(kInvalidArgument, RegisterTable(Table("TYPE", {{"n", 7, 4, 0}})));
-  EXPECT_EQ(kInvalidArgument, RegisterTable(TableDefinition{"NONE", {{"n", 5, 2, 0}}, 2, {}}));
+  EXPECT_EQ(kInvalidArgument,
+            RegisterTable(TableDefinition{"NONE", {{"n", 5, 2, 0}}, 2, {}, {}, false}));
   EXPECT_TRUE(ListTables().empty());
   EXPECT_TRUE(capture.contains("text does not lie within the 12-byte row"));
 }
