@@ -5,7 +5,7 @@
 #                 each fuzz target for FUZZ_SMOKE_SECONDS from its seeds
 #   make demo     build, lay out a demo home in demo-home/ and run the agent in the foreground
 #   make bench    Release build of the benchmarks, then run them
-#   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/
+#   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/ share/
 #   make asan / make tsan   sanitizer builds with their unit tests (asan: clang, with the
 #                           thread-safety analysis)
 #   make test-tsan          the concurrency tests (runtime, situations, analyzer) under TSan
@@ -26,7 +26,8 @@ DEPS := cmake ninja-build g++ make pkg-config git curl \
         libssl-dev zlib1g-dev libbrotli-dev libicu-dev icu-devtools \
         libcpp-httplib-dev nlohmann-json3-dev libspdlog-dev libfmt-dev \
         libcli11-dev libinih-dev clang libclang-rt-14-dev \
-        libpcap-dev tshark tcpdump nginx-light pcapfix python3-dpkt goaccess prometheus
+        libpcap-dev tshark tcpdump nginx-light pcapfix python3-dpkt goaccess prometheus \
+        libjs-chart.js chromium
 
 SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
 

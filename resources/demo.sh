@@ -72,7 +72,8 @@ ctl() { "$bin/q7ctl" "$@" >/dev/null; }
   cat >&2 <<MSG
 
 == q7agent demo is running: home ${home}, API http://${addr} ==
-Rows appear within a few seconds. In another terminal:
+Rows appear within a few seconds. The dashboard: open http://${addr}/ in a browser.
+In another terminal:
   export Q7_HOME=${home}
   ${bin}/q7ctl sample Q7TXSM                     # transactions over the last 24 hours
   ${bin}/q7ctl sample Q7APPCS                    # applications, current 5-minute interval
