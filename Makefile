@@ -5,7 +5,7 @@
 #                 each fuzz target for FUZZ_SMOKE_SECONDS from its seeds
 #   make demo     build, lay out a demo home in demo-home/ and run the agent in the foreground
 #   make bench    Release build of the benchmarks, then run them
-#   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/
+#   make install  lay out a home at PREFIX (default /opt/q7agent): bin/ lib/ config/ logs/ share/
 #   make deb      Release build in build-deb/, then its Debian package (CPack)
 #   make asan / make tsan   sanitizer builds with their unit tests (asan: clang, with the
 #                           thread-safety analysis)
@@ -28,7 +28,7 @@ DEPS := cmake ninja-build g++ make pkg-config git curl \
         libcpp-httplib-dev nlohmann-json3-dev libspdlog-dev libfmt-dev \
         libcli11-dev libinih-dev clang libclang-rt-14-dev \
         libpcap-dev tshark tcpdump nginx-light pcapfix python3-dpkt goaccess prometheus tmux \
-        dpkg-dev adduser
+        dpkg-dev adduser libjs-chart.js chromium
 
 SUDO := $(shell [ "$$(id -u)" = 0 ] || echo sudo)
 
@@ -190,7 +190,7 @@ DEMO_HOME ?= $(CURDIR)/demo-home
 demo: build
 	@resources/demo.sh --check "$(DEMO_HOME)"
 	@$(MAKE) --no-print-directory install PREFIX="$(DEMO_HOME)" >/dev/null
-	@echo "q7agent demo: home $(DEMO_HOME)/, API on http://127.0.0.1:7420 (Ctrl-C stops it)"
+	@echo "q7agent demo: dashboard on http://127.0.0.1:7420/ (home $(DEMO_HOME)/; Ctrl-C stops it)"
 	@resources/demo.sh "$(DEMO_HOME)"
 
 format:

@@ -11,9 +11,6 @@
 // file is removed and the old file is left as it was.
 //
 // Crash tests set Q7_KILL_DURING_WRITE to a fragment of a path: the process then kills itself
-// with SIGKILL half-way through writing the first replacement of a file whose path holds it.
-//
-// Crash tests set Q7_KILL_DURING_WRITE to a fragment of a path: the process then kills itself
 // with SIGKILL half-way through writing the first piece of any replacement of a file whose path
 // holds it.
 //

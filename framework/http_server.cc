@@ -38,6 +38,16 @@ constexpr int kStreamedRows = 512;
 
 const auto kProcessStart = std::chrono::steady_clock::now();
 
+// The API's own paths: reading them off loopback needs the token, whatever files are served.
+bool IsApiPath(const std::string& path) {
+  for (const char* prefix : {"/api", "/metrics", "/healthz"}) {
+    if (path.rfind(prefix, 0) == 0) {
+      return true;
+    }
+  }
+  return false;
+}
+
 nlohmann::json AgentInfo() {
   nlohmann::json info;
   const auto uptime = std::chrono::duration_cast<std::chrono::seconds>(
@@ -198,9 +208,13 @@ bool HttpServer::ParseAddress(const std::string& address, std::string* host, int
 
 void HttpServer::InstallRoutes(bool loopback) {
   httplib::Server& s = *server_;
-  // Changes always need the token; on an address others can reach, so does reading.
+  // Changes always need the token; on an address others can reach, so does reading, except
+  // the dashboard's files, which hold no data (its requests to the API carry the token).
   s.set_pre_routing_handler([this, loopback](const httplib::Request& req, httplib::Response& res) {
     const bool change = req.method != "GET" && req.method != "HEAD";
+    if (!change && !static_dir_.empty() && !IsApiPath(req.path)) {
+      return httplib::Server::HandlerResponse::Unhandled;
+    }
     if ((change || !loopback) &&
         !BearerMatches(req.get_header_value("Authorization"), api_token_)) {
       Q7_TRACE(kUnit, kTraceError, "%s %s refused: missing or wrong bearer token",
@@ -276,6 +290,14 @@ int HttpServer::Start(const std::string& address, std::string* error) {
     server_ = std::move(secure);
   } else {
     server_ = std::make_unique<httplib::Server>();
+  }
+  // The file handler runs before the routes, for files that exist; no-cache has browsers ask
+  // again, so an upgraded dashboard is never mixed with an old one.
+  if (!static_dir_.empty() &&
+      !server_->set_mount_point("/", static_dir_, {{"Cache-Control", "no-cache"}})) {
+    Q7_TRACE(kUnit, kTraceError, "cannot serve the files of %s: serving the API only",
+             static_dir_.c_str());
+    static_dir_.clear();
   }
   InstallRoutes(IsLoopbackHost(host));
   if (port == 0) {

@@ -1,7 +1,7 @@
 #pragma once
 
 // The framework's HTTP API server (cpp-httplib): JSON endpoints on one listening address,
-// served from a pool of worker threads.
+// served from a pool of worker threads, and optionally the dashboard's static files at "/".
 //
 // Lifetime: Start once, Stop once (the destructor stops too). Start and Stop run on the main
 // loop's thread; handlers run on the pool's threads and read only thread-safe framework state.
@@ -46,6 +46,12 @@ class HttpServer {
   // Serves GET /api/v1/alerts from the book, which must outlive the server. Call before Start.
   void ServeAlerts(const AlertBook* book) { alerts_ = book; }
 
+  // Serves the files below the directory `dir` at "/" (index.html for a directory), before
+  // the routes and only for files that exist. GET and HEAD of such paths need no token even
+  // off loopback, since the files hold no data; /api/, /metrics and /healthz keep their rules.
+  // Call before Start; when `dir` cannot be served, Start traces it and serves the API only.
+  void ServeStatic(std::string dir) { static_dir_ = std::move(dir); }
+
   // Stops serving and waits for requests in flight. Safe to call when not started.
   void Stop();
 
@@ -65,6 +71,7 @@ class HttpServer {
   std::string tls_certificate_;
   std::string tls_key_;
   const AlertBook* alerts_ = nullptr;  // null: no alerts endpoint
+  std::string static_dir_;  // empty: the API only
 };
 
 }  // namespace fw

@@ -74,6 +74,23 @@ void ForgetStoppedAlertSituations(const fw::AlertBook& alerts, fw::AlertSampler*
   }
 }
 
+// The dashboard's files, <home>share/dashboard/, when they are installed; without them the
+// API is served alone, which is no fault (a build tree or a home laid out by hand).
+void ServeDashboard(fw::HttpServer* server) {
+  std::string home;
+  if (fw::GetHomeDirectory(&home) != fw::kOk) {
+    return;
+  }
+  const std::string dir = home + "share/dashboard/";
+  struct stat st {};
+  if (::stat(dir.c_str(), &st) != 0 || !S_ISDIR(st.st_mode)) {
+    Q7_TRACE(kUnit, fw::kTraceSummary, "no dashboard in %s: serving the API only", dir.c_str());
+    return;
+  }
+  server->ServeStatic(dir);
+  Q7_TRACE(kUnit, fw::kTraceSummary, "dashboard served from %s", dir.c_str());
+}
+
 }  // namespace
 
 int kunmain(int /*argc*/, char** /*argv*/) {
@@ -129,6 +146,7 @@ int kunmain(int /*argc*/, char** /*argv*/) {
   fw::HttpServer server;
   server.SetApiToken(token);
   server.ServeAlerts(&alerts);
+  ServeDashboard(&server);
   std::string address_file;
   std::string certificate;
   std::string key;

@@ -71,14 +71,16 @@ ctl() { "$bin/q7ctl" "$@" >/dev/null; }
   addr=$(cat "${home}logs/q7agent.addr")
   cat >&2 <<MSG
 
-== q7agent demo is running: home ${home}, API http://${addr} ==
-Rows appear within a few seconds. In another terminal:
+== q7agent demo is running: dashboard http://${addr}/ ==
+Open the dashboard in a browser; rows appear within a few seconds. Home ${home},
+API http://${addr}/api/v1/. In another terminal:
   export Q7_HOME=${home}
   ${bin}/q7ctl sample Q7TXSM                     # transactions over the last 24 hours
   ${bin}/q7ctl sample Q7APPCS                    # applications, current 5-minute interval
   ${bin}/q7ctl sample Q7TXINS --limit 5          # checkout instances
   ${bin}/q7ctl situation list
   ${bin}/q7ctl events
+  ${bin}/q7ctl top                               # live: busiest applications and transactions
   curl -s http://${addr}/api/v1/tables/Q7CLNTSM
 Ctrl-C here stops the agent and the collector.
 
