@@ -44,8 +44,8 @@ std::vector<MatchedRow> MatchedRows(const Sample& sample) {
   return matched;
 }
 
-AlertSampler::AlertSampler(AlertBook* book, WebhookSender* webhooks)
-    : book_(book), webhooks_(webhooks) {}
+AlertSampler::AlertSampler(AlertBook* book, WebhookSender* webhooks, std::function<bool()> ready)
+    : book_(book), webhooks_(webhooks), ready_(std::move(ready)) {}
 
 AlertSampler::~AlertSampler() {
   Stop();
@@ -106,6 +106,38 @@ AlertSampler::Counters AlertSampler::counters() const {
   return counters_;
 }
 
+void AlertSampler::WriteMetrics(PrometheusText& text) const {
+  const Counters mine = counters();
+  text.family("q7_alert_samples_total", "counter", "Samples taken for alerting situations.");
+  text.sample("q7_alert_samples_total", {}, static_cast<double>(mine.samples));
+  text.family("q7_alert_sample_failures_total", "counter",
+              "Samples of alerting situations that their table refused.");
+  text.sample("q7_alert_sample_failures_total", {}, static_cast<double>(mine.sample_failures));
+  text.family("q7_alert_changes_total", "counter", "Alerts raised and cleared.");
+  text.sample("q7_alert_changes_total", {}, static_cast<double>(mine.changes));
+  text.family("q7_alerts_open", "gauge", "Alerts open now.");
+  text.sample("q7_alerts_open", {}, static_cast<double>(book_->Open().size()));
+  if (webhooks_ == nullptr) {
+    return;
+  }
+  const WebhookSender::Counters sent = webhooks_->counters();
+  text.family("q7_webhook_deliveries_total", "counter",
+              "Alert changes handed to webhooks, by what became of them.");
+  for (const auto& [result, value] :
+       {std::pair<const char*, std::uint64_t>{"delivered", sent.delivered},
+        {"given_up", sent.given_up},
+        {"dropped_full", sent.dropped_full},
+        {"dropped_invalid", sent.dropped_invalid}}) {
+    text.sample("q7_webhook_deliveries_total", {{"result", result}}, static_cast<double>(value));
+  }
+  text.family(
+      "q7_webhook_attempts_failed_total", "counter",
+      "Webhook POSTs that failed (timeout, refused, not 2xx); each is retried or given up.");
+  text.sample("q7_webhook_attempts_failed_total", {}, static_cast<double>(sent.attempts_failed));
+  text.family("q7_webhook_pending", "gauge", "Alert changes waiting for their webhook.");
+  text.sample("q7_webhook_pending", {}, static_cast<double>(sent.pending));
+}
+
 void AlertSampler::Run() {
   for (;;) {
     std::vector<Stopped> forget;
@@ -148,7 +180,7 @@ void AlertSampler::Run() {
     for (const Stopped& s : forget) {
       Publish(book_->ForgetSituation(s.name, Now()), s.webhook);
     }
-    if (generation != 0) {
+    if (generation != 0 && ready_()) {
       SampleOne(next, generation);
     }
   }

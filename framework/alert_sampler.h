@@ -15,6 +15,7 @@
 
 #include <chrono>
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <string>
 #include <thread>
@@ -22,6 +23,7 @@
 
 #include "framework/alert_book.h"
 #include "framework/mutex.h"
+#include "framework/prometheus_text.h"
 #include "framework/situations.h"
 #include "framework/table_sample.h"
 #include "framework/webhook_sender.h"
@@ -40,8 +42,11 @@ class AlertSampler : public SituationListener {
     std::uint64_t changes = 0;          // raises and clears
   };
 
-  // book and webhooks must outlive the sampler. The thread starts with Start.
-  AlertSampler(AlertBook* book, WebhookSender* webhooks);
+  // book and webhooks must outlive the sampler. The thread starts with Start. Until ready()
+  // holds, nothing is sampled: an agent that has not yet restored its saved data answers with
+  // empty tables, which would clear every open alert (and raise them again soon after).
+  AlertSampler(
+      AlertBook* book, WebhookSender* webhooks, std::function<bool()> ready = [] { return true; });
   ~AlertSampler() override;  // Stop()
   AlertSampler(const AlertSampler&) = delete;
   AlertSampler& operator=(const AlertSampler&) = delete;
@@ -57,6 +62,9 @@ class AlertSampler : public SituationListener {
   void SituationStopped(const std::string& name) override EXCLUDES(mutex_);
 
   Counters counters() const EXCLUDES(mutex_);
+
+  // The alert series of /metrics: samples, changes, open alerts, webhook deliveries.
+  void WriteMetrics(PrometheusText& text) const EXCLUDES(mutex_);
 
  private:
   struct Scheduled {
@@ -76,6 +84,7 @@ class AlertSampler : public SituationListener {
 
   AlertBook* const book_;
   WebhookSender* const webhooks_;
+  const std::function<bool()> ready_;
 
   mutable Mutex mutex_;
   CondVar wake_;

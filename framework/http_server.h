@@ -71,7 +71,7 @@ class HttpServer {
   std::string tls_certificate_;
   std::string tls_key_;
   const AlertBook* alerts_ = nullptr;  // null: no alerts endpoint
-  std::string static_dir_;  // empty: the API only
+  std::string static_dir_;             // empty: the API only
 };
 
 }  // namespace fw

@@ -16,6 +16,7 @@
 #include "framework/atomic_file.h"
 #include "framework/environment.h"
 #include "framework/http_server.h"
+#include "framework/metrics_api.h"
 #include "framework/mutex.h"
 #include "framework/runtime_state.h"
 #include "framework/situations.h"
@@ -58,6 +59,22 @@ void WarnIfPlainOffLoopback(const fw::HttpServer& server, const std::string& add
                           "Q7_TLS_CERT and Q7_TLS_KEY to serve HTTPS.",
                           server.bound_address().c_str());
   }
+}
+
+// True once the agent says its analyzer has restored its saved data (health "analyzer" is
+// "running", not "starting"); true without an agent's word.
+bool AgentRestored() {
+  std::function<void(nlohmann::json&)> provider;
+  {
+    fw::MutexLock lock(fw::State().mutex);
+    provider = fw::State().health_provider;
+  }
+  if (!provider) {
+    return true;
+  }
+  nlohmann::json health = nlohmann::json::object();
+  provider(health);
+  return health.value("analyzer", "running") != "starting";
 }
 
 // Situations stopped, or dropped from the list, while the agent was down: their open alerts
@@ -121,7 +138,7 @@ int kunmain(int /*argc*/, char** /*argv*/) {
     fw::TracePrintfAlways(kUnit, fw::kTraceError, __func__, "%s", error.c_str());
   }
   fw::WebhookSender webhooks;
-  fw::AlertSampler sampler(&alerts, &webhooks);
+  fw::AlertSampler sampler(&alerts, &webhooks, AgentRestored);
   fw::SetSituationListener(&sampler);
   if (has_config) {
     fw::SetSituationsFile(config_dir + "q7_situations.json");
@@ -143,6 +160,7 @@ int kunmain(int /*argc*/, char** /*argv*/) {
     address = kDefaultHttpAddress;
   }
   sampler.Start();
+  fw::SetFrameworkMetrics([&sampler](fw::PrometheusText& text) { sampler.WriteMetrics(text); });
   fw::HttpServer server;
   server.SetApiToken(token);
   server.ServeAlerts(&alerts);
@@ -192,6 +210,7 @@ int kunmain(int /*argc*/, char** /*argv*/) {
   // Stopping the agent never stops a situation: drop them without their destructors. Open
   // alerts stay open in their file for the next start.
   fw::ResetSituations();
+  fw::SetFrameworkMetrics(nullptr);
   sampler.Stop();
   webhooks.Stop();
   return 0;

@@ -190,9 +190,11 @@ void ServeLatency(const httplib::Request& req, httplib::Response& res) {
 
 void ServeMetrics(const httplib::Request&, httplib::Response& res) {
   MetricsProvider provider;
+  MetricsProvider framework;
   {
     MutexLock lock(State().mutex);
     provider = State().metrics_provider;
+    framework = State().framework_metrics;
   }
   if (!provider) {
     ReplyError(res, 503, "metrics are not available: no agent is running");
@@ -200,6 +202,9 @@ void ServeMetrics(const httplib::Request&, httplib::Response& res) {
   }
   PrometheusText text;
   provider(text);
+  if (framework) {
+    framework(text);
+  }
   res.status = 200;
   res.set_content("", 0, "text/plain; version=0.0.4; charset=utf-8");
   res.body = text.take();
@@ -210,6 +215,11 @@ void ServeMetrics(const httplib::Request&, httplib::Response& res) {
 void SetLatencyProvider(LatencyProvider provider) {
   MutexLock lock(State().mutex);
   State().latency_provider = std::move(provider);
+}
+
+void SetFrameworkMetrics(MetricsProvider provider) {
+  MutexLock lock(State().mutex);
+  State().framework_metrics = std::move(provider);
 }
 
 void SetMetricsProvider(MetricsProvider provider) {

@@ -49,6 +49,9 @@ using MetricsProvider = std::function<void(PrometheusText&)>;
 
 void SetLatencyProvider(LatencyProvider provider);
 void SetMetricsProvider(MetricsProvider provider);
+// The framework's own series (alerts, webhooks), written after the agent's; the main loop sets
+// and clears it.
+void SetFrameworkMetrics(MetricsProvider provider);
 
 void InstallMetricsRoutes(httplib::Server& server);
 

@@ -30,6 +30,7 @@ struct RuntimeState {
   std::function<void(nlohmann::json&)> info_provider GUARDED_BY(mutex);
   LatencyProvider latency_provider GUARDED_BY(mutex);
   MetricsProvider metrics_provider GUARDED_BY(mutex);
+  MetricsProvider framework_metrics GUARDED_BY(mutex);  // the framework's own, after the agent's
 
   // The shutdown request; shutdown_cv wakes the main loop.
   Mutex shutdown_mutex;

@@ -92,8 +92,10 @@ void describeAnalyzer(nlohmann::json& out) {
     return;
   }
   const int thread = analyzer->GetState();
-  out["state"] = thread == CvelThread::kStateRunning
-                     ? (analyzer->isShutdownRequested() ? "stopping" : "running")
+  // "starting" until the run has restored its saved data: the tables are not whole before.
+  out["state"] = thread == CvelThread::kStateRunning ? (analyzer->isShutdownRequested() ? "stopping"
+                                                        : analyzer->isRestored()        ? "running"
+                                                                                 : "starting")
                  : thread == CvelThread::kStateFinished ? "stopped"
                                                         : "not started";
   const IntakeCounters::Snapshot intake = analyzer->intakeCounters().snapshot();

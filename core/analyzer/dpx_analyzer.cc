@@ -118,6 +118,7 @@ void CDPXAnalyzer::startRun() {
   referenceInterval = getCurrentOverTimeInterval();
   rolloverCount = 0;
   lastCheckpointAt = fw::Now();
+  restored = true;
 }
 
 void CDPXAnalyzer::rollover() {

@@ -170,6 +170,11 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   const ReadPosition& resumePosition() const {
     return resumeAt;
   }
+  // True once the run has restored what an earlier run left (checkpoint, current interval):
+  // until then the tables answer empty, which alerts must not take for recovery. Any thread.
+  bool isRestored() const {
+    return restored.load();
+  }
 
  protected:
   void Run() override;
@@ -248,9 +253,10 @@ class CDPXAnalyzer : public CAnalyzer, public CvelThread {
   };
   std::optional<PendingCheckpoint> pendingCheckpoint;  // handed to the writer
   CheckpointStats checkpointStats;
-  ReadPosition position;   // every record before it is in the trees
-  ReadPosition resumeAt;   // the recovered checkpoint's position
-  bool recovered = false;  // startRun loaded a checkpoint
+  ReadPosition position;              // every record before it is in the trees
+  ReadPosition resumeAt;              // the recovered checkpoint's position
+  bool recovered = false;             // startRun loaded a checkpoint
+  std::atomic<bool> restored{false};  // startRun is done
   uint64_t checkpointSequence = 0;
   long lastCheckpointAt = 0;      // when the last one was tried, seconds since 1970
   bool checkpointDue = false;     // a rollover happened since the last one

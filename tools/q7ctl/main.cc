@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "tools/q7ctl/alerts.h"
 #include "tools/q7ctl/client.h"
 #include "tools/q7ctl/column_sets.h"
 #include "tools/q7ctl/config.h"
@@ -37,6 +38,7 @@ Examples:
   q7ctl situation start Shop --table Q7TXPTNS APPLICATIN=Shop APPPATTERN='*' \
         TRANSACTN=Checkout TRANSPATTN='*/checkout*'
   q7ctl events --follow
+  q7ctl alerts --follow
 Exit status: 0 done, 1 the agent failed or could not be reached, 2 bad command line.
 )";
 
@@ -247,6 +249,14 @@ int Events(ApiClient& client, const FormatOptions& options, bool follow) {
   if (!result.ok()) {
     return Fail(result);
   }
+  // Alert changes travel with the rows; `q7ctl alerts` shows them in columns of their own.
+  Json rows = Json::array();
+  for (const Json& event : events) {
+    if (!IsAlertChange(event)) {
+      rows.push_back(event);
+    }
+  }
+  events = std::move(rows);
   if (!follow) {
     if (events.empty()) {
       SayNone(options, "events");
@@ -258,7 +268,39 @@ int Events(ApiClient& client, const FormatOptions& options, bool follow) {
   writer.Begin(options.readable ? ReadableRows(events) : events);
   // Runs until the agent ends the stream or the operator interrupts q7ctl.
   return Fail(client.Stream("/api/v1/events/stream", [&writer, &options](const Json& event) {
-    writer.Write(options.readable ? ReadableRows(Json::array({event}))[0] : event);
+    if (!IsAlertChange(event)) {
+      writer.Write(options.readable ? ReadableRows(Json::array({event}))[0] : event);
+    }
+    return true;
+  }));
+}
+
+int Alerts(ApiClient& client, const FormatOptions& options, bool recent, bool follow, bool raw) {
+  Json reply, items;
+  Result result = client.Get("/api/v1/alerts", &reply);
+  if (result.ok()) {
+    result = ArrayField(reply, recent ? "recent" : "open", &items);
+  }
+  if (!result.ok()) {
+    return Fail(result);
+  }
+  const Json rows = recent ? AlertChangeRows(items, raw) : OpenAlertRows(items, raw);
+  if (!follow) {
+    if (rows.empty()) {
+      SayNone(options, recent ? "alert changes kept" : "open alerts");
+    }
+    WriteRows(rows, options, std::cout, options.format == OutputFormat::kJson ? items : Json());
+    return 0;
+  }
+  // Then each change as it comes, from the events stream, which carries table rows too.
+  StreamWriter writer(options, std::cout);
+  writer.Begin(rows);
+  return Fail(client.Stream("/api/v1/events/stream", [&](const Json& event) {
+    if (IsAlertChange(event)) {
+      writer.Write(options.format == OutputFormat::kJson
+                       ? event
+                       : AlertChangeRows(Json::array({event}), raw)[0]);
+    }
     return true;
   }));
 }
@@ -408,6 +450,21 @@ int Run(int argc, char** argv) {
   stop->add_option("NAME", name, "Situation name")->required();
   stop->footer(Help("Example:\n  q7ctl situation stop Shop"));
 
+  CLI::App* alerts = app.add_subcommand("alerts", "Show the open alerts, or the recent changes");
+  bool alerts_recent = false;
+  bool alerts_follow = false;
+  alerts->add_flag("--recent", alerts_recent,
+                   "The last changes (raised, cleared), oldest first, instead of the open alerts");
+  alerts->add_flag("-f,--follow", alerts_follow,
+                   "Then print each change as it happens, until interrupted");
+  alerts->footer(Help(
+      "Alerts come from situations on row tables, which the agent samples every \"every\"\n"
+      "seconds; a key raises after \"for\" matching samples and clears when it stops matching.\n"
+      "Examples:\n"
+      "  q7ctl alerts\n"
+      "  q7ctl alerts --recent -o csv\n"
+      "  q7ctl alerts --follow"));
+
   CLI::App* events = app.add_subcommand("events", "Show the agent's recent data events");
   bool follow = false;
   events->add_flag("-f,--follow", follow,
@@ -448,6 +505,9 @@ int Run(int argc, char** argv) {
   }
   if (top->parsed()) {
     return RunTop(client, connection.url, top_options);
+  }
+  if (alerts->parsed()) {
+    return Alerts(client, options, alerts_recent, alerts_follow, globals.raw);
   }
   if (list->parsed()) {
     return SituationList(client, options);
