@@ -94,7 +94,7 @@ test-tsan: deps
 	  history_test
 	build-tsan/bin/runtime_test --gtest_brief=1
 	build-tsan/bin/tama_test --gtest_brief=1 --gtest_filter='ServiceMonitor*'
-	build-tsan/bin/framework_test --gtest_brief=1 --gtest_filter='Events*:Situations*:CondVar*'
+	build-tsan/bin/framework_test --gtest_brief=1 --gtest_filter='Events*:Situations*:CondVar*:Alert*:Webhook*'
 	build-tsan/bin/analyzer_test --gtest_brief=1 --gtest_filter='Situation*:Processing*:WaitFor*:DataFileMonitor*:FileManager*:Checkpoint*'
 	build-tsan/bin/history_test --gtest_brief=1 --gtest_filter='CheckpointWriter*'
 

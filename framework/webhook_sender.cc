@@ -210,6 +210,10 @@ void WebhookSender::Stop() {
     MutexLock lock(mutex_);
     stopping_ = true;
     wake_.NotifyAll();
+    // A receiver that hangs must not hold up the agent's stop for the POST's timeouts.
+    if (in_flight_ != nullptr) {
+      in_flight_->stop();
+    }
   }
   worker_.join();
   std::uint64_t abandoned = 0;
@@ -344,7 +348,7 @@ std::chrono::milliseconds WebhookSender::Backoff(int failed_attempts) const {
   return std::min(backoff, options_.max_backoff);
 }
 
-bool WebhookSender::Post(const Attempt& attempt, std::string* failure) const {
+bool WebhookSender::Post(const Attempt& attempt, std::string* failure) {
   try {
     // Built from the parsed host and port: httplib's own "scheme://host:port" parsing takes no
     // IPv6 address with letters in it and would quietly fall back to plain HTTP on port 80.
@@ -358,6 +362,22 @@ bool WebhookSender::Post(const Attempt& attempt, std::string* failure) const {
     client->set_connection_timeout(options_.timeout);
     client->set_read_timeout(options_.timeout);
     client->set_write_timeout(options_.timeout);
+    {
+      MutexLock lock(mutex_);
+      if (stopping_) {
+        *failure = "stopping";
+        return false;
+      }
+      in_flight_ = client.get();
+    }
+    // Cleared however the POST ends, exceptions included, before the client goes.
+    struct InFlight {
+      WebhookSender* sender;
+      ~InFlight() {
+        MutexLock lock(sender->mutex_);
+        sender->in_flight_ = nullptr;
+      }
+    } in_flight{this};
     const httplib::Result result =
         client->Post(attempt.url.target, attempt.body, "application/json");
     if (!result) {

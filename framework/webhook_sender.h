@@ -27,6 +27,10 @@
 #include "framework/mutex.h"
 #include "framework/thread_annotations.h"
 
+namespace httplib {
+class ClientImpl;
+}
+
 namespace fw {
 
 // A webhook URL taken apart for the HTTP client.
@@ -116,7 +120,7 @@ class WebhookSender {
   // The wait after the given number of failed attempts.
   std::chrono::milliseconds Backoff(int failed_attempts) const;
   // One POST; a 2xx answer is true, anything else false with *failure saying what happened.
-  bool Post(const Attempt& attempt, std::string* failure) const;
+  bool Post(const Attempt& attempt, std::string* failure) EXCLUDES(mutex_);
 
   const Options options_;
 
@@ -129,6 +133,9 @@ class WebhookSender {
   bool stopping_ GUARDED_BY(mutex_) = false;
   Counters counters_ GUARDED_BY(mutex_);
 
+  // The client of the POST in flight, so that Stop can cut it short rather than wait for its
+  // timeouts; set and cleared by the worker.
+  httplib::ClientImpl* in_flight_ GUARDED_BY(mutex_) = nullptr;
   std::thread worker_;
 };
 

@@ -282,5 +282,21 @@ TEST(WebhookSenderTest, StopDuringLongBackoffIsPrompt) {
   EXPECT_EQ(1u, sender.counters().pending);
 }
 
+// A POST waiting on a receiver that hangs is cut short by Stop, not waited out: the agent's
+// own stop must not take the POST's timeouts.
+TEST(WebhookSenderTest, StopDuringAHangingPostIsPrompt) {
+  Receiver hung;
+  hung.Hang(true);
+  WebhookSender::Options options = FastOptions();
+  options.timeout = 30s;
+  WebhookSender sender(options);
+  ASSERT_TRUE(sender.Enqueue(hung.url(), "{}"));
+  ASSERT_TRUE(PollUntil([&] { return hung.bodies().size() == 1; }, 5s));
+  const auto start = std::chrono::steady_clock::now();
+  sender.Stop();
+  EXPECT_LT(std::chrono::steady_clock::now() - start, 2s);
+  EXPECT_EQ(0u, sender.counters().delivered);
+}
+
 }  // namespace
 }  // namespace fw

@@ -68,6 +68,14 @@ ctl() { "$bin/q7ctl" "$@" >/dev/null; }
   # The head office LAN, one row per /24 subnet.
   ctl situation start OfficeLan --table Q7CLNTPTNS CLIENTNA='Head office' CLIENTHOPT='*' \
     CLIENTPPT='10.1.*' AGGUNIQLY=2
+  # The example alerts, sampled every 15 s rather than every minute so that the demo shows them.
+  for example in "${home}"share/situations/*.json; do
+    [ -e "$example" ] || continue
+    quick=$(mktemp)
+    sed 's/"every": 60/"every": 15/' "$example" > "$quick"
+    ctl situation start "$(basename "$example" .json)" --file "$quick"
+    rm -f "$quick"
+  done
   addr=$(cat "${home}logs/q7agent.addr")
   cat >&2 <<MSG
 
@@ -81,6 +89,7 @@ API http://${addr}/api/v1/. In another terminal:
   ${bin}/q7ctl situation list
   ${bin}/q7ctl events
   ${bin}/q7ctl top                               # live: busiest applications and transactions
+  ${bin}/q7ctl alerts --follow                   # open alerts, then each raise and clear
   curl -s http://${addr}/api/v1/tables/Q7CLNTSM
 Ctrl-C here stops the agent and the collector.
 

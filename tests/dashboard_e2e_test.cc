@@ -239,6 +239,26 @@ TEST_F(DashboardE2ETest, ShowsWhatTheApiGivesAndDrillsDown) {
   }
   EXPECT_TRUE(browser->Screenshot(outputDir() + "dashboard-detail.png", &error)) << error;
 
+  // An alert on every application with a request: the alert list shows each, as the API does.
+  std::string reply;
+  ASSERT_EQ(201, send(address, "PUT", "/api/v1/situations/Busy",
+                      R"({"table": "Q7APPSM", "conditions": [{"column": "totreq", "op": "GE",
+                          "value": "1"}], "every": 1, "severity": "critical"})",
+                      token(), &reply))
+      << reply;
+  std::size_t open = 0;
+  ASSERT_TRUE(waitFor(
+      [&] {
+        open = get(address, "/api/v1/alerts", &status)["open"].size();
+        return open > 0 && open == get(address, "/api/v1/tables/Q7APPSM", &status)["rows"].size();
+      },
+      10s));
+  EXPECT_TRUE(
+      browser->WaitUntil("document.querySelectorAll('#alerts tbody tr.alert.critical')"
+                         ".length === " +
+                             std::to_string(open),
+                         10s));
+
   // A phone: the page fits its width (wide tables scroll in their own boxes).
   ASSERT_TRUE(browser->SetViewport(390, 844, true, &error)) << error;
   EXPECT_TRUE(

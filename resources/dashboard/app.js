@@ -582,10 +582,32 @@ function renderSituations(situations) {
     }))))));
 }
 
+// An alert's key as "column=value" words.
+const keyText = (key) => Object.entries(key || {}).map(([column, value]) => `${column}=${value}`).join(' ');
+const isAlertChange = (e) => e.kind === 'raised' || e.kind === 'cleared';
+const epochTime = (seconds) => (seconds ? new Date(seconds * 1000).toLocaleString() : '');
+
+function renderAlerts(open) {
+  fillBody('alerts', open.map((a) => el('tr', {class: `alert ${a.severity}`},
+    el('td', {class: 'severity', text: a.severity}),
+    el('td', {class: 'name', text: a.situation}),
+    el('td', {class: 'key', text: keyText(a.key)}),
+    el('td', {text: epochTime(a.raised_at_epoch)}))));
+  if (open.length === 0) {
+    fillBody('alerts', [el('tr', {}, el('td', {class: 'muted', colSpan: 4, text: 'No open alerts.'}))]);
+  }
+}
+
 const SEVERITY = {I: 'info', W: 'warning', E: 'error'};
 
 function renderEvents(events) {
   const items = [...events].reverse().slice(0, 20).map((e) => {
+    if (isAlertChange(e)) {
+      return el('li', {class: `event ${e.kind === 'raised' ? 'error' : 'info'}`},
+        el('time', {text: epochTime(e.at_epoch)}),
+        el('span', {class: 'msgid', text: `alert ${e.kind}`}),
+        el('span', {class: 'msgtext', text: `${e.situation} (${e.severity}): ${keyText(e.key)}`}));
+    }
     const kind = SEVERITY[String(e.msgid || '').slice(-1)] || 'info';
     return el('li', {class: `event ${kind}`},
       el('time', {text: fmtStamp(e.msgdattime)}),
@@ -638,13 +660,14 @@ async function readSubtransactions(txTotals) {
 async function refresh() {
   const {app, tx} = selection();
   const slow = tick % SLOW_EVERY === 0 || slowRows.key !== app;
-  const [agent, health, appRows, appLatency, situations, events] = await Promise.all([
+  const [agent, health, appRows, appLatency, situations, events, alerts] = await Promise.all([
     api('/api/v1/agent'),
     api('/healthz'),
     sample('Q7APPSM'),
     latency('application'),
     api('/api/v1/situations'),
     api('/api/v1/events?limit=50'),
+    api('/api/v1/alerts?limit=0'),
     readOverTime(),
     slow ? readSlowTables(app) : null,
   ]);
@@ -669,6 +692,7 @@ async function refresh() {
   updateCharts(app, overTimeFor(app), splitGroups, statusTotals);
   renderClients(slowRows.clients);
   renderServers(slowRows.servers);
+  renderAlerts(alerts.open || []);
   renderSituations(situations.situations || []);
   renderEvents(events.events || []);
   if (app && app !== shownApp) {

@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <CLI/CLI.hpp>
+#include <fstream>
 #include <iostream>
 #include <string>
 #include <vector>
@@ -205,6 +206,24 @@ int SituationList(ApiClient& client, const FormatOptions& options) {
     SayNone(options, "situations started");
   }
   WriteRows(rows, options, std::cout, situations);
+  return 0;
+}
+
+// The situation in a JSON file, as PUT takes it: {"table", "conditions", "every", ...}.
+int SituationStartFromFile(ApiClient& client, const std::string& name, const std::string& path) {
+  std::ifstream in(path);
+  const Json body = Json::parse(in, nullptr, false);
+  if (!in.is_open() || body.is_discarded() || !body.is_object()) {
+    std::cerr << "q7ctl: " << path << " is not a JSON object of a situation\n";
+    return kUsage;
+  }
+  Json reply;
+  const Result result = client.Put(SituationTarget(name), body, &reply);
+  if (!result.ok()) {
+    return Fail(result);
+  }
+  std::cout << "situation " << name << " started on " << body.value("table", "?") << " from "
+            << path << '\n';
   return 0;
 }
 
@@ -432,19 +451,31 @@ int Run(int argc, char** argv) {
   CLI::App* start = situation->add_subcommand("start", "Start a situation on a pattern table");
   std::string name, situation_table;
   std::vector<std::string> words;
+  std::string situation_file;
   start->add_option("NAME", name, "Situation name")->required();
-  start->add_option("--table", situation_table, "Table the situation runs on, e.g. Q7TXPTNS")
-      ->required();
-  start
-      ->add_option("CONDITIONS", words,
-                   "COLUMN=VALUE words, each one EQ condition, in order (a column may repeat: "
-                   "a pattern table reads complete sets of conditions)")
-      ->required()
-      ->check(ConditionValidator());
+  CLI::Option* table_option =
+      start->add_option("--table", situation_table, "Table the situation runs on, e.g. Q7TXPTNS");
+  CLI::Option* words_option =
+      start
+          ->add_option("CONDITIONS", words,
+                       "COLUMN=VALUE words, each one EQ condition, in order (a column may repeat: "
+                       "a pattern table reads complete sets of conditions)")
+          ->check(ConditionValidator());
+  CLI::Option* file_option =
+      start
+          ->add_option("--file", situation_file,
+                       "The situation as JSON, as the API takes it: {\"table\", \"conditions\": "
+                       "[{\"column\", \"op\", \"value\"}], and for alerts \"every\", \"for\", "
+                       "\"severity\", \"webhook\"}")
+          ->check(CLI::ExistingFile);
+  file_option->excludes(table_option)->excludes(words_option);
+  table_option->needs(words_option);
+  words_option->needs(table_option);
   start->footer(
-      Help("Example:\n"
+      Help("Examples:\n"
            "  q7ctl situation start Shop --table Q7TXPTNS APPLICATIN=Shop APPPATTERN='*' \\\n"
            "        TRANSACTN=Checkout TRANSPATTN='*/checkout*'\n"
+           "  q7ctl situation start AppAvailability --file app-availability.json   # an alert\n"
            "The value is everything after the first '=', so it may hold '=' itself."));
   CLI::App* stop = situation->add_subcommand("stop", "Stop a situation");
   stop->add_option("NAME", name, "Situation name")->required();
@@ -513,6 +544,13 @@ int Run(int argc, char** argv) {
     return SituationList(client, options);
   }
   if (start->parsed()) {
+    if (!situation_file.empty()) {
+      return SituationStartFromFile(client, name, situation_file);
+    }
+    if (situation_table.empty()) {
+      std::cerr << "q7ctl: situation start needs --table and CONDITIONS, or --file\n";
+      return kUsage;
+    }
     return SituationStart(client, name, situation_table, words);
   }
   if (stop->parsed()) {
