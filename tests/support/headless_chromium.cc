@@ -324,18 +324,13 @@ std::optional<nlohmann::json> HeadlessChromium::Evaluate(const std::string& expr
 }
 
 bool HeadlessChromium::WaitUntil(const std::string& expression, std::chrono::milliseconds timeout) {
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  for (;;) {
-    std::string error;
-    const auto value = Evaluate(expression, &error);
-    if (value && *value == true) {
-      return true;
-    }
-    if (std::chrono::steady_clock::now() >= deadline) {
-      return false;
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(50));
-  }
+  return PollUntil(
+      [&] {
+        std::string error;
+        const auto value = Evaluate(expression, &error);
+        return value && *value == true;
+      },
+      timeout);
 }
 
 bool HeadlessChromium::Navigate(const std::string& url, std::string* error) {
