@@ -12,9 +12,9 @@ namespace capture {
 namespace {
 
 constexpr Micros kSecond = 1000000;
-constexpr Micros kMs = 1000;
+constexpr Micros kMillis = 1000;
 
-class CollectingSink : public RecordSink {
+class RecordCollector : public RecordSink {
  public:
   void Write(const sm3gen::Record& record) override { records.push_back(record); }
   std::vector<sm3gen::Record> records;
@@ -35,8 +35,8 @@ HttpExchange Exchange(const std::string& target, const std::string& content_type
   e.response.status = 200;
   e.response.content_type = content_type;
   e.start = start;
-  e.request_last = start + 1 * kMs;
-  e.response_first = start + 21 * kMs;
+  e.request_last = start + 1 * kMillis;
+  e.response_first = start + 21 * kMillis;
   e.response_last = end;
   e.response_bytes = 1000;
   return e;
@@ -56,7 +56,7 @@ class PageAssemblerTest : public ::testing::Test {
     return out;
   }
 
-  CollectingSink sink_;
+  RecordCollector sink_;
   CaptureStats stats_;
   RecordBuilder builder_;
   PageAssembler pages_;
@@ -66,19 +66,19 @@ using Strings = std::vector<std::string>;
 
 TEST_F(PageAssemblerTest, PageIsWrittenWithItsObjectsWhenTheNextPageArrives) {
   const Micros t = 1000 * kSecond;
-  Add(Exchange("/index.html", "text/html; charset=utf-8", "", t, t + 100 * kMs));
-  Add(Exchange("/s.css", "text/css", "http://shop.example/index.html", t + 150 * kMs,
-               t + 300 * kMs));
+  Add(Exchange("/index.html", "text/html; charset=utf-8", "", t, t + 100 * kMillis));
+  Add(Exchange("/s.css", "text/css", "http://shop.example/index.html", t + 150 * kMillis,
+               t + 300 * kMillis));
   HttpExchange revalidated = Exchange("/logo.png", "", "http://SHOP.example:80/index.html#top",
-                                      t + 160 * kMs, t + 250 * kMs);
+                                      t + 160 * kMillis, t + 250 * kMillis);
   revalidated.response.status = 304;
   revalidated.response_bytes = 200;
   Add(revalidated);
-  Add(Exchange("/clip.mp4", "video/mp4", "http://shop.example/index.html", t + 170 * kMs,
-               t + 900 * kMs));
+  Add(Exchange("/clip.mp4", "video/mp4", "http://shop.example/index.html", t + 170 * kMillis,
+               t + 900 * kMillis));
   EXPECT_TRUE(sink_.records.empty());  // the view is still open
   Add(Exchange("/next.html", "text/html", "http://shop.example/index.html", t + 2 * kSecond,
-               t + 2100 * kMs));
+               t + 2100 * kMillis));
   EXPECT_EQ(Written(),
             (Strings{"hpage /index.html", "hobj /s.css", "hobj /logo.png", "video /clip.mp4"}));
   const sm3gen::Record& page = sink_.records[0];
@@ -99,22 +99,22 @@ TEST_F(PageAssemblerTest, PageIsWrittenWithItsObjectsWhenTheNextPageArrives) {
 
 TEST_F(PageAssemblerTest, ViewsCloseAfterQuietOrAfterThirtySeconds) {
   const Micros t = 2000 * kSecond;
-  Add(Exchange("/a.html", "text/html", "", t, t + 10 * kMs));
+  Add(Exchange("/a.html", "text/html", "", t, t + 10 * kMillis));
   Add(Exchange("/a.js", "application/javascript", "http://shop.example/a.html", t + 1 * kSecond,
-               t + 1100 * kMs));
+               t + 1100 * kMillis));
   pages_.Advance(t + 6 * kSecond);  // 4.9 s after the last reply: still open
   EXPECT_TRUE(sink_.records.empty());
-  pages_.Advance(t + 7200 * kMs);  // looked at once a second of capture time
+  pages_.Advance(t + 7200 * kMillis);  // looked at once a second of capture time
   EXPECT_EQ(Written(), (Strings{"hpage /a.html", "hobj /a.js"}));
 
   // A page whose objects keep coming is closed 30 s after it started; a later object is no
   // longer its own.
   sink_.records.clear();
   const Micros u = 3000 * kSecond;
-  Add(Exchange("/live.html", "text/html", "", u, u + 10 * kMs));
+  Add(Exchange("/live.html", "text/html", "", u, u + 10 * kMillis));
   for (int i = 1; i <= 31; ++i) {
     Add(Exchange("/poll", "application/json", "http://shop.example/live.html", u + i * kSecond,
-                 u + i * kSecond + 50 * kMs));
+                 u + i * kSecond + 50 * kMillis));
   }
   ASSERT_FALSE(sink_.records.empty());
   EXPECT_EQ(Written()[0], "hpage /live.html");
@@ -124,8 +124,10 @@ TEST_F(PageAssemblerTest, ViewsCloseAfterQuietOrAfterThirtySeconds) {
 TEST_F(PageAssemblerTest, ObjectsThatEndBeforeTheirPageAreClaimedByIt) {
   const Micros t = 4000 * kSecond;
   // The style sheet and an image it loads finish while the HTML is still arriving.
-  Add(Exchange("/s.css", "text/css", "http://shop.example/big.html", t + 50 * kMs, t + 80 * kMs));
-  Add(Exchange("/bg.png", "image/png", "http://shop.example/s.css", t + 90 * kMs, t + 120 * kMs));
+  Add(Exchange("/s.css", "text/css", "http://shop.example/big.html", t + 50 * kMillis,
+               t + 80 * kMillis));
+  Add(Exchange("/bg.png", "image/png", "http://shop.example/s.css", t + 90 * kMillis,
+               t + 120 * kMillis));
   Add(Exchange("/big.html", "text/html", "", t, t + 2 * kSecond));
   pages_.Flush();
   EXPECT_EQ(Written(), (Strings{"hpage /big.html", "hobj /s.css", "hobj /bg.png"}));
@@ -135,10 +137,10 @@ TEST_F(PageAssemblerTest, ObjectsThatEndBeforeTheirPageAreClaimedByIt) {
 // An access log without virtual hosts names no host: its pages match Referers by path.
 TEST_F(PageAssemblerTest, PagesWithoutAHostMatchByPath) {
   const Micros t = 6000 * kSecond;
-  HttpExchange page = Exchange("/shop/index.html?a=1", "text/html", "", t, t + 10 * kMs);
+  HttpExchange page = Exchange("/shop/index.html?a=1", "text/html", "", t, t + 10 * kMillis);
   page.request.host.clear();
   HttpExchange css = Exchange("/s.css", "text/css", "https://www.example/shop/index.html?a=1",
-                              t + 20 * kMs, t + 30 * kMs);
+                              t + 20 * kMillis, t + 30 * kMillis);
   css.request.host.clear();
   Add(page);
   Add(css);
@@ -160,11 +162,11 @@ TEST_F(PageAssemblerTest, PagesWithoutAHostMatchByPath) {
 TEST_F(PageAssemblerTest, ObjectsWithoutTheirPageBecomePagesOfTheirOwn) {
   const Micros t = 5000 * kSecond;
   // No Referer: a page at once (an API call, a download).
-  Add(Exchange("/api/cart", "application/json", "", t, t + 5 * kMs));
+  Add(Exchange("/api/cart", "application/json", "", t, t + 5 * kMillis));
   EXPECT_EQ(Written(), (Strings{"hpage /api/cart"}));
   // A Referer naming a page never seen: it waits for that page, then stands alone.
   Add(Exchange("/x.png", "image/png", "http://elsewhere.example/", t + kSecond,
-               t + kSecond + 5 * kMs));
+               t + kSecond + 5 * kMillis));
   pages_.Advance(t + 20 * kSecond);
   EXPECT_EQ(sink_.records.size(), 1u);
   pages_.Advance(t + 32 * kSecond);
@@ -188,11 +190,11 @@ TEST_F(PageAssemblerTest, OldestHeldNamesTheEarliestUnwrittenExchange) {
     e.sequence = sequence;
     Add(e);
   };
-  add(Exchange("/api/ping", "application/json", "", t, t + kMs), 1);
+  add(Exchange("/api/ping", "application/json", "", t, t + kMillis), 1);
   EXPECT_EQ(pages_.OldestHeld(), UINT64_MAX);
-  add(Exchange("/x.png", "image/png", "http://elsewhere.example/", t, t + kMs, 2), 2);
-  add(Exchange("/a.html", "text/html", "", t, t + 10 * kMs), 3);
-  add(Exchange("/a.css", "text/css", "http://shop.example/a.html", t, t + 20 * kMs), 4);
+  add(Exchange("/x.png", "image/png", "http://elsewhere.example/", t, t + kMillis, 2), 2);
+  add(Exchange("/a.html", "text/html", "", t, t + 10 * kMillis), 3);
+  add(Exchange("/a.css", "text/css", "http://shop.example/a.html", t, t + 20 * kMillis), 4);
   EXPECT_EQ(pages_.OldestHeld(), 2u);
   pages_.Advance(t + 10 * kSecond);  // the view closed; the orphan still waits
   EXPECT_EQ(Written(), (Strings{"hpage /api/ping", "hpage /a.html", "hobj /a.css"}));
@@ -211,10 +213,10 @@ TEST(RecordBuilderTest, FieldsFromAnExchange) {
   e.request.host = "shop.example:8080";
   e.request.user_agent = std::string(300, 'u') + "\r\n";
   e.response.version_minor = 0;
-  e.start = 1700000000 * kSecond + 999 * kMs;
-  e.request_last = e.start + 10 * kMs + 400;   // 10.4 ms
-  e.response_first = e.start + 30 * kMs;       // server 19.6 ms -> 20
-  e.response_last = e.start + 55 * kMs + 600;  // 55.6 ms -> 56
+  e.start = 1700000000 * kSecond + 999 * kMillis;
+  e.request_last = e.start + 10 * kMillis + 400;   // 10.4 ms
+  e.response_first = e.start + 30 * kMillis;       // server 19.6 ms -> 20
+  e.response_last = e.start + 55 * kMillis + 600;  // 55.6 ms -> 56
   e.request_bytes = 300;
   e.response_bytes = 5000;
   e.request_packets = 1;
@@ -222,7 +224,7 @@ TEST(RecordBuilderTest, FieldsFromAnExchange) {
   e.request_acks = 1;
   e.response_acks = 2;
   PageFigures figures;
-  figures.load = 100 * kMs;
+  figures.load = 100 * kMillis;
   const sm3gen::Record r = builder.Build(e, sm3gen::RecordKind::kPage, figures);
   EXPECT_EQ(r.time_utc, 1700000000);
   EXPECT_EQ(r.client_address, "2001:db8::1");

@@ -13,7 +13,7 @@ namespace {
 using testing::Generate;
 using testing::ReadLines;
 
-ModelOptions Options() {
+ModelOptions StreamModel() {
   ModelOptions options;
   options.start = 1795450020;
   options.av_share = 10;
@@ -31,7 +31,7 @@ StreamOptions Stream(LineEnd line_end, int64_t junk_every = 0) {
 // '<' inside.
 TEST(sm3genStream, EveryLineIsOneFramedRecord) {
   for (LineEnd line_end : {LineEnd::kLf, LineEnd::kCrLf, LineEnd::kMixed}) {
-    const auto out = Generate(Options(), Stream(line_end), 2000);
+    const auto out = Generate(StreamModel(), Stream(line_end), 2000);
     const auto lines = ReadLines(out.bytes);
     ASSERT_EQ(2000u, lines.size());
     int crlf = 0;
@@ -51,8 +51,8 @@ TEST(sm3genStream, EveryLineIsOneFramedRecord) {
 }
 
 TEST(sm3genStream, LineEndsJunkAndTailLeaveRecordsAlone) {
-  const auto plain = Generate(Options(), Stream(LineEnd::kLf), 500);
-  const auto noisy = Generate(Options(), Stream(LineEnd::kMixed, 3), 500, true);
+  const auto plain = Generate(StreamModel(), Stream(LineEnd::kLf), 500);
+  const auto noisy = Generate(StreamModel(), Stream(LineEnd::kMixed, 3), 500, true);
   const auto a = ReadLines(plain.bytes);
   const auto b = ReadLines(noisy.bytes);
   ASSERT_EQ(501u, b.size());
@@ -65,7 +65,7 @@ TEST(sm3genStream, LineEndsJunkAndTailLeaveRecordsAlone) {
 
 // Junk comes before every Nth record only: 1-40 bytes, never '<' or NUL, some of them high.
 TEST(sm3genStream, JunkBlocksPrecedeEveryNthRecord) {
-  const auto out = Generate(Options(), Stream(LineEnd::kLf, 3), 600);
+  const auto out = Generate(StreamModel(), Stream(LineEnd::kLf, 3), 600);
   const auto lines = ReadLines(out.bytes);
   bool high = false;
   for (size_t i = 0; i < lines.size(); ++i) {
@@ -89,7 +89,7 @@ TEST(sm3genStream, JunkBlocksPrecedeEveryNthRecord) {
 
 TEST(sm3genStream, TruncatedTailEndsWithoutTrailerAndIsNotCounted) {
   for (uint64_t seed = 1; seed <= 20; ++seed) {
-    ModelOptions options = Options();
+    ModelOptions options = StreamModel();
     options.seed = seed;
     const auto whole = Generate(options, Stream(LineEnd::kCrLf), 50);
     const auto cut = Generate(options, Stream(LineEnd::kCrLf), 50, true);

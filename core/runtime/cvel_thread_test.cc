@@ -13,6 +13,7 @@
 #include "core/runtime/cvel_status.h"
 #include "core/runtime/cvel_thread_library.h"
 #include "framework/trace.h"
+#include "tests/support/test_util.h"
 
 namespace {
 
@@ -29,17 +30,6 @@ class FunctionThread : public CvelThread {
   std::function<void(FunctionThread&)> body_;
 };
 
-bool Eventually(const std::function<bool()>& condition) {
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-  while (!condition()) {
-    if (std::chrono::steady_clock::now() > deadline) {
-      return false;
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(1));
-  }
-  return true;
-}
-
 std::string LastErrorLocation() {
   CvelErrorStack stack;
   CvelErrorManager::GetStack(stack);
@@ -50,7 +40,9 @@ std::string LastErrorLocation() {
 // the body (destroying the start event under the waiting thread used to hang).
 TEST(CvelThreadTest, DestroyingAnUnstartedThreadEndsIt) {
   std::atomic<bool> ran{false};
-  { FunctionThread thread([&ran](FunctionThread&) { ran = true; }); }
+  {
+    FunctionThread thread([&ran](FunctionThread&) { ran = true; });
+  }
   EXPECT_FALSE(ran.load());
 }
 
@@ -74,7 +66,8 @@ TEST(CvelThreadTest, SecondStartGivesBadState) {
 TEST(CvelThreadTest, JoinOfFinishedThreadReturnsAtOnce) {
   FunctionThread thread([](FunctionThread&) {});
   ASSERT_EQ(cvel::kOk, thread.Start());
-  ASSERT_TRUE(Eventually([&] { return thread.GetState() == CvelThread::kStateFinished; }));
+  ASSERT_TRUE(q7test::PollUntil([&] { return thread.GetState() == CvelThread::kStateFinished; },
+                                std::chrono::seconds(10)));
   EXPECT_EQ(cvel::kOk, thread.Join());
   EXPECT_EQ(cvel::kOk, thread.Join());
 }

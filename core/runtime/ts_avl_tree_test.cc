@@ -8,16 +8,17 @@
 
 namespace {
 
-class Row : public TreeNode {
+class SharedRow : public TreeNode {
  public:
-  explicit Row(int key, bool deleteOnRemoval) : key_(key), deleteOnRemoval_(deleteOnRemoval) {}
+  explicit SharedRow(int key, bool deleteOnRemoval)
+      : key_(key), deleteOnRemoval_(deleteOnRemoval) {}
   bool equals(TreeNode& other, int) override { return key_ == Key(other); }
   bool greater(TreeNode& other, int) override { return key_ > Key(other); }
   const char* toString(int) override { return nullptr; }
   bool getDeleteOnRemoval() override { return deleteOnRemoval_; }
   void setDeleteOnRemoval(bool on) override { deleteOnRemoval_ = on; }
   int key() const { return key_; }
-  static int Key(TreeNode& node) { return static_cast<Row&>(node).key_; }
+  static int Key(TreeNode& node) { return static_cast<SharedRow&>(node).key_; }
 
  private:
   const int key_;
@@ -37,10 +38,10 @@ TEST(TsAvlTreeTest, ConcurrentReadersAndWritersKeepPinnedRowsAlive) {
     threads.emplace_back([&, t] {
       for (int i = 0; i < kRounds; ++i) {
         int key = (i * 7 + t * 13) % kKeys;
-        Row probe(key, false);
+        SharedRow probe(key, false);
         switch ((i + t) % 4) {
           case 0: {
-            auto* row = new Row(key, true);
+            auto* row = new SharedRow(key, true);
             if (!tree.addNode(row)) {
               delete row;
             }
@@ -49,7 +50,7 @@ TEST(TsAvlTreeTest, ConcurrentReadersAndWritersKeepPinnedRowsAlive) {
           case 1: {
             TreeNode* pinned = tree.AddRef(&probe);
             if (pinned != nullptr) {
-              readMismatches += Row::Key(*pinned) != key;
+              readMismatches += SharedRow::Key(*pinned) != key;
               tree.Release(&probe);
             }
             break;
@@ -72,7 +73,7 @@ TEST(TsAvlTreeTest, ConcurrentReadersAndWritersKeepPinnedRowsAlive) {
   EXPECT_EQ(0, readMismatches.load());
   long counted = 0;
   for (int key = 0; key < kKeys; ++key) {
-    Row probe(key, false);
+    SharedRow probe(key, false);
     counted += tree.findNode(&probe) != nullptr;
   }
   EXPECT_EQ(counted, tree.getSize());
@@ -83,13 +84,13 @@ TEST(TsAvlTreeTest, TrimInsideAddDoesNotRelock) {
   TSAVLTree tree(0, false);
   tree.initialize(0, false, 4, 2);
   for (int key = 0; key < 20; ++key) {
-    ASSERT_TRUE(tree.addNode(new Row(key, true)));
+    ASSERT_TRUE(tree.addNode(new SharedRow(key, true)));
   }
   EXPECT_LT(tree.getSize(), 4);
   tree.dumpTree();
   tree.dumpSortedTree();
-  Row probe(19, false);
-  EXPECT_EQ(19, Row::Key(*tree.findNode(&probe)));
+  SharedRow probe(19, false);
+  EXPECT_EQ(19, SharedRow::Key(*tree.findNode(&probe)));
 }
 
 }  // namespace

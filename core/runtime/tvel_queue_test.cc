@@ -12,6 +12,7 @@
 
 #include "core/runtime/cvel_status.h"
 #include "core/runtime/typed_transaction.h"
+#include "tests/support/test_util.h"
 
 namespace {
 
@@ -20,17 +21,6 @@ using Queue = TvelQueue<_TYPED_TRANSACTION>;
 
 // How long a thread that should stay blocked is watched before we accept that it is blocked.
 constexpr auto kBlockedWindow = std::chrono::milliseconds(100);
-
-bool Eventually(const std::function<bool()>& condition) {
-  const auto deadline = Clock::now() + std::chrono::seconds(10);
-  while (!condition()) {
-    if (Clock::now() > deadline) {
-      return false;
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(1));
-  }
-  return true;
-}
 
 _TYPED_TRANSACTION Item(uint32_t sequence) {
   return _TYPED_TRANSACTION{sequence, nullptr};
@@ -108,7 +98,7 @@ TEST(TvelQueueTest, GetBatchTakesWhatGetWould) {
     putDone = true;
   });
   EXPECT_EQ(7, queue.GetBatch(out, 10, 1000));
-  ASSERT_TRUE(Eventually([&] { return putDone.load(); }));
+  ASSERT_TRUE(q7test::PollUntil([&] { return putDone.load(); }, std::chrono::seconds(10)));
   producer.join();
   EXPECT_EQ(1, queue.GetBatch(out, 10, 1000));
   EXPECT_EQ(7u, out[0].type);
@@ -174,7 +164,7 @@ TEST(TvelQueueTest, PutBeyondCapacityBlocksUntilGet) {
   _TYPED_TRANSACTION item;
   ASSERT_EQ(cvel::kOk, queue.Get(item, 1000));
   EXPECT_EQ(0u, item.type);
-  EXPECT_TRUE(Eventually([&] { return stored.load(); }));
+  EXPECT_TRUE(q7test::PollUntil([&] { return stored.load(); }, std::chrono::seconds(10)));
   producer.join();
   const std::vector<uint32_t> rest = Drain(queue);
   ASSERT_EQ(Queue::kMaxItems, rest.size());
@@ -202,14 +192,16 @@ TEST(TvelQueueTest, EachFreeSlotTakesExactlyOneBlockedProducer) {
       }
     });
   }
-  ASSERT_TRUE(Eventually([&] { return started.load() == kProducers; }));
+  ASSERT_TRUE(
+      q7test::PollUntil([&] { return started.load() == kProducers; }, std::chrono::seconds(10)));
   std::this_thread::sleep_for(kBlockedWindow);
   ASSERT_EQ(0, stored.load());
 
   _TYPED_TRANSACTION item;
   for (int freed = 1; freed <= kProducers; ++freed) {
     ASSERT_EQ(cvel::kOk, queue.Get(item, 1000));
-    ASSERT_TRUE(Eventually([&] { return stored.load() >= freed; }));
+    ASSERT_TRUE(
+        q7test::PollUntil([&] { return stored.load() >= freed; }, std::chrono::seconds(10)));
     std::this_thread::sleep_for(kBlockedWindow);  // the woken rest must not squeeze in
     EXPECT_EQ(freed, stored.load());
     EXPECT_TRUE(queue.IsFull());
