@@ -134,26 +134,31 @@ HeadlessChromium::HeadlessChromium(const std::string& profile_dir, const std::st
     return;
   }
 
-  // Its page: the one target of type "page" that about:blank opened.
+  // Its page: the one target of type "page" that about:blank opened. A failed call ends the
+  // polling with *error set.
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(15);
   std::string page;
-  while (page.empty() && std::chrono::steady_clock::now() < deadline) {
-    const int id = next_id_++;
-    if (!Send({{"id", id}, {"method", "Target.getTargets"}}, error)) {
-      return;
-    }
-    const auto targets = AwaitAnswer(id, deadline, error);
-    if (!targets) {
-      return;
-    }
-    for (const auto& target : (*targets)["targetInfos"]) {
-      if (target.value("type", "") == "page") {
-        page = target.value("targetId", "");
-      }
-    }
-    if (page.empty()) {
-      std::this_thread::sleep_for(std::chrono::milliseconds(50));
-    }
+  bool failed = false;
+  PollUntil(
+      [&] {
+        const int id = next_id_++;
+        const auto targets = Send({{"id", id}, {"method", "Target.getTargets"}}, error)
+                                 ? AwaitAnswer(id, deadline, error)
+                                 : std::nullopt;
+        if (!targets) {
+          failed = true;
+          return true;
+        }
+        for (const auto& target : (*targets)["targetInfos"]) {
+          if (target.value("type", "") == "page") {
+            page = target.value("targetId", "");
+          }
+        }
+        return !page.empty();
+      },
+      std::chrono::seconds(15));
+  if (failed) {
+    return;
   }
   const int id = next_id_++;
   if (page.empty() || !Send({{"id", id},
