@@ -167,14 +167,25 @@ bool WebhookSender::Enqueue(std::string url, std::string body) {
   const bool valid = ParseWebhookUrl(url, &parsed, &error);
   bool stopped = false;
   std::uint64_t dropped = 0;  // the refusal's counter after this one
+  bool traced = true;         // whether this refusal is traced
   {
     MutexLock lock(mutex_);
+    const auto now = std::chrono::steady_clock::now();
+    const auto due = [&](std::optional<std::chrono::steady_clock::time_point>& last) {
+      if (last && now - *last < options_.drop_trace_period) {
+        return false;
+      }
+      last = now;
+      return true;
+    };
     if (stopping_) {
       stopped = true;
     } else if (!valid) {
       dropped = ++counters_.dropped_invalid;
+      traced = due(invalid_traced_);
     } else if (counters_.pending >= options_.capacity) {
       dropped = ++counters_.dropped_full;
+      traced = due(full_traced_);
     } else {
       auto [it, inserted] = destinations_.try_emplace(std::move(url));
       if (inserted) {
@@ -189,6 +200,9 @@ bool WebhookSender::Enqueue(std::string url, std::string body) {
     }
   }
   // Traced without the lock, so that the worker never waits for the trace file.
+  if (!traced) {
+    return false;
+  }
   if (stopped) {
     Q7_TRACE(kUnit, kTraceError, "webhook delivery dropped: the sender is stopped");
   } else if (!valid) {

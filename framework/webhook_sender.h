@@ -21,6 +21,7 @@
 #include <cstdint>
 #include <deque>
 #include <map>
+#include <optional>
 #include <string>
 #include <thread>
 
@@ -63,6 +64,9 @@ class WebhookSender {
     std::chrono::milliseconds max_backoff{60000};
     // Attempts per delivery, the first one included (at least 1).
     int max_attempts = 6;
+    // Refusals of one kind (queue full, URL unusable) are traced at the first and then at most
+    // once a period, each trace with the running count: a dead receiver must not flood the trace.
+    std::chrono::milliseconds drop_trace_period{60000};
   };
 
   // Totals since construction.
@@ -132,6 +136,9 @@ class WebhookSender {
   std::uint64_t next_sequence_ GUARDED_BY(mutex_) = 0;
   bool stopping_ GUARDED_BY(mutex_) = false;
   Counters counters_ GUARDED_BY(mutex_);
+  // When a refusal of each kind was last traced; empty before the first.
+  std::optional<std::chrono::steady_clock::time_point> full_traced_ GUARDED_BY(mutex_);
+  std::optional<std::chrono::steady_clock::time_point> invalid_traced_ GUARDED_BY(mutex_);
 
   // The client of the POST in flight, so that Stop can cut it short rather than wait for its
   // timeouts; set and cleared by the worker.
