@@ -119,13 +119,15 @@ soak: build
 
 # The agent under load (Release): LOAD_RATE records a second ingested for LOAD_SECONDS while 20
 # clients sample its tables and events; exits non-zero when a request fails, ingestion stalls
-# for over a second or memory grows after the first minute.
+# for over a second or memory grows after the first minute. LOAD_ALERT_EVERY=N adds five
+# alerting situations sampled every N seconds whose webhook never answers.
 LOAD_RATE ?= 200000
 LOAD_SECONDS ?= 120
+LOAD_ALERT_EVERY ?= 0
 load: deps
 	cmake -S . -B build-release $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Release -DQ7_BUILD_TESTS=OFF
 	cmake --build build-release -j $(JOBS) --target q7load
-	build-release/bin/q7load --rate $(LOAD_RATE) --seconds $(LOAD_SECONDS)
+	build-release/bin/q7load --rate $(LOAD_RATE) --seconds $(LOAD_SECONDS) --alert-every $(LOAD_ALERT_EVERY)
 
 FUZZ_SECONDS ?= 60
 FUZZ_SMOKE_SECONDS ?= 10

@@ -10,7 +10,13 @@
 // time it is appended, so the agent sees live traffic; rolled files are removed once the agent
 // reads a later one, so a long run needs little disk.
 //
+// With --alert-every N (seconds) it also starts five alerting situations sampled every N
+// seconds, whose webhook is a receiver that takes each POST and never answers, and says whether
+// the sampler kept its pace and what became of the alert changes: alerting, and a receiver that
+// hangs, must cost ingestion nothing.
+//
 // Usage: q7load [--rate N] [--seconds N] [--clients N] [--requests N] [--interval-minutes N]
+//               [--alert-every N]
 // Exit status: 0 when every check holds, 1 when one fails, 2 on a bad command line.
 
 #include <dirent.h>
@@ -21,6 +27,7 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <condition_variable>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
@@ -28,6 +35,9 @@
 #include <ctime>
 #include <filesystem>
 #include <fstream>
+#include <iterator>
+#include <map>
+#include <memory>
 #include <mutex>
 #include <nlohmann/json.hpp>
 #include <random>
@@ -52,6 +62,7 @@ struct Options {
   int clients = 20;
   int requests = 1000;
   int intervalMinutes = 0;  // 0: the agent's default
+  int alertEvery = 0;       // seconds between alert samples; 0: no alerting situations
   int64_t pool = 400000;    // records generated once and replayed
 };
 
@@ -345,12 +356,113 @@ bool ParseOptions(int argc, char** argv, Options* o) {
       o->requests = static_cast<int>(value);
     } else if (flag == "--interval-minutes") {
       o->intervalMinutes = static_cast<int>(value);
+    } else if (flag == "--alert-every") {
+      o->alertEvery = static_cast<int>(value);
     } else {
       return false;
     }
   }
   return argc % 2 == 1 && o->rate > 0 && o->seconds >= 10 && o->clients > 0 &&
-         o->requests >= o->clients && o->intervalMinutes >= 0;
+         o->requests >= o->clients && o->intervalMinutes >= 0 && o->alertEvery >= 0;
+}
+
+// A webhook receiver that takes each POST and holds it without an answer until Release: the
+// receiver that hangs, whose deliveries must wait without holding anything else up.
+class HangingReceiver {
+ public:
+  HangingReceiver() {
+    server_.Post("/hook", [this](const httplib::Request&, httplib::Response& res) {
+      held_.fetch_add(1);
+      std::unique_lock<std::mutex> lock(mutex_);
+      released_cv_.wait(lock, [this] { return released_; });
+      res.status = 204;
+    });
+    port_ = server_.bind_to_any_port("127.0.0.1");
+    thread_ = std::thread([this] { server_.listen_after_bind(); });
+  }
+  ~HangingReceiver() {
+    Release();
+    server_.stop();
+    thread_.join();
+  }
+  HangingReceiver(const HangingReceiver&) = delete;
+  HangingReceiver& operator=(const HangingReceiver&) = delete;
+
+  std::string url() const { return "http://127.0.0.1:" + std::to_string(port_) + "/hook"; }
+  long held() const { return held_.load(); }
+  void Release() {
+    {
+      std::lock_guard<std::mutex> lock(mutex_);
+      released_ = true;
+    }
+    released_cv_.notify_all();
+  }
+
+ private:
+  httplib::Server server_;
+  int port_ = 0;
+  std::thread thread_;
+  std::atomic<long> held_{0};
+  std::mutex mutex_;
+  std::condition_variable released_cv_;
+  bool released_ = false;  // guarded by mutex_
+};
+
+// What an operator would alert on: the example situations' conditions on the application
+// tables, and two on the large per-transaction and per-server tables, one of which matches
+// every application so that changes (and webhook calls) happen at all.
+struct AlertSituation {
+  const char* name;
+  const char* table;
+  const char* conditions;
+};
+constexpr AlertSituation kAlertSituations[] = {
+    {"LoadAvailability", "Q7APPSM",
+     R"([{"column": "pcavail", "op": "LT", "value": "95000"},
+         {"column": "totreq", "op": "GE", "value": "20"}])"},
+    {"LoadSlow", "Q7APPCS", R"([{"column": "pcslow", "op": "GT", "value": "20000"}])"},
+    {"LoadEveryApplication", "Q7APPSM", R"([{"column": "totreq", "op": "GE", "value": "1"}])"},
+    {"LoadTransactionFailures", "Q7TXSM",
+     R"([{"column": "pcfail", "op": "GT", "value": "50000"},
+         {"column": "totreq", "op": "GE", "value": "10"}])"},
+    {"LoadServerTime", "Q7SRVSM", R"([{"column": "oatime", "op": "GT", "value": "2000"}])"},
+};
+
+// Starts the alerting situations; false (having said why) when the agent refuses one.
+bool StartAlertSituations(httplib::Client& api, const std::string& token, int every,
+                          const std::string& webhook) {
+  for (const AlertSituation& s : kAlertSituations) {
+    const std::string body = std::string(R"({"table": ")") + s.table + R"(", "conditions": )" +
+                             s.conditions + R"(, "every": )" + std::to_string(every) +
+                             R"(, "for": 1, "severity": "warning", "webhook": ")" + webhook +
+                             R"("})";
+    const auto res = api.Put(("/api/v1/situations/" + std::string(s.name)).c_str(),
+                             {{"Authorization", "Bearer " + token}}, body, "application/json");
+    if (!res || (res->status != 200 && res->status != 201)) {
+      std::fprintf(stderr, "situation %s refused: %s\n", s.name,
+                   res ? (std::to_string(res->status) + " " + res->body).c_str()
+                       : httplib::to_string(res.error()).c_str());
+      return false;
+    }
+  }
+  return true;
+}
+
+// The agent's alerting series from /metrics, by name (with labels); empty on failure.
+std::map<std::string, double> AlertMetrics(httplib::Client& api) {
+  std::map<std::string, double> values;
+  const auto res = api.Get("/metrics");
+  if (!res || res->status != 200) {
+    return values;
+  }
+  std::istringstream lines(res->body);
+  for (std::string line; std::getline(lines, line);) {
+    if (line.rfind("q7_alert", 0) == 0 || line.rfind("q7_webhook", 0) == 0) {
+      const size_t space = line.rfind(' ');
+      values[line.substr(0, space)] = std::atof(line.c_str() + space + 1);
+    }
+  }
+  return values;
 }
 
 }  // namespace
@@ -361,7 +473,7 @@ int main(int argc, char** argv) {
     std::fprintf(stderr,
                  "usage: %s [--rate N (200000)] [--seconds N (120, at least 10)] [--clients N "
                  "(20)] [--requests N (1000, at least one a client)] [--interval-minutes N "
-                 "(the agent's default)]\n",
+                 "(the agent's default)] [--alert-every N (0: no alerting situations)]\n",
                  argv[0]);
     return 2;
   }
@@ -427,6 +539,20 @@ int main(int argc, char** argv) {
       options.rate, pool.size(), pool.averageBytes(), options.seconds, options.clients,
       tables.size(), options.requests);
   std::fflush(stdout);
+
+  // The alerting situations, with the receiver that never answers.
+  std::unique_ptr<HangingReceiver> receiver;
+  std::map<std::string, double> alertsBefore;
+  if (options.alertEvery > 0) {
+    receiver = std::make_unique<HangingReceiver>();
+    if (!StartAlertSituations(api, agent.ApiToken(), options.alertEvery, receiver->url())) {
+      return 1;
+    }
+    alertsBefore = AlertMetrics(api);
+    std::printf("alerting: %zu situations sampled every %d s; their webhook never answers\n",
+                std::size(kAlertSituations), options.alertEvery);
+    std::fflush(stdout);
+  }
 
   std::atomic<bool> stop{false};
   Feeder feeder(pool, agent.data(), options.rate);
@@ -512,6 +638,8 @@ int main(int argc, char** argv) {
   }
   stop.store(true);
   const double ran = SecondsSince(began);
+  const std::map<std::string, double> alertsAfter =
+      options.alertEvery > 0 ? AlertMetrics(api) : std::map<std::string, double>();
   streamClient.stop();
   for (std::thread& client : clients) {
     client.join();
@@ -565,7 +693,38 @@ int main(int argc, char** argv) {
               counters.value("checkpoints_written", 0LL),
               counters.value("checkpoint_pause_ms_max", 0LL),
               counters.value("checkpoint_write_ms_max", 0LL));
+  // Alerting kept its pace: the sampler took (nearly) every sample due over the run.
+  bool alertPace = true;
+  if (options.alertEvery > 0) {
+    const auto delta = [&](const std::string& name) {
+      const auto after = alertsAfter.find(name);
+      const auto before = alertsBefore.find(name);
+      return (after == alertsAfter.end() ? 0 : after->second) -
+             (before == alertsBefore.end() ? 0 : before->second);
+    };
+    const auto value = [&](const std::string& name) {
+      const auto at = alertsAfter.find(name);
+      return at == alertsAfter.end() ? -1.0 : at->second;
+    };
+    const double due = std::size(kAlertSituations) * ran / options.alertEvery;
+    const double samples = delta("q7_alert_samples_total");
+    alertPace = samples >= due * 0.9;
+    std::printf(
+        "alerting: %.0f samples taken of %.0f due, %.0f failed; %.0f changes, %.0f open at the "
+        "end\n",
+        samples, due, delta("q7_alert_sample_failures_total"), delta("q7_alert_changes_total"),
+        value("q7_alerts_open"));
+    std::printf(
+        "webhook: %ld POSTs held by the receiver; %.0f changes waiting, %.0f dropped from the "
+        "full queue, %.0f attempts failed\n",
+        receiver->held(), value("q7_webhook_pending"),
+        value("q7_webhook_deliveries_total{result=\"dropped_full\"}"),
+        value("q7_webhook_attempts_failed_total"));
+  }
   agent.Stop();
+  if (receiver) {
+    receiver->Release();
+  }
   const std::string trace = agent.Trace();
   const long errors = std::count(trace.begin(), trace.end(), '\n');
   // Its ERROR records, the first few shown: under load there should be none.
@@ -593,11 +752,16 @@ int main(int argc, char** argv) {
   const bool flat = !judged || levelAtEnd <= levelAtMinute * 11 / 10;
   std::printf(
       "%s rate held | %s every request answered | %s no stall over 1 s | %s memory flat "
-      "after the first minute | %s every record processed\n",
+      "after the first minute | %s every record processed | %s alert samples on time\n",
       rateHeld ? "PASS" : "FAIL", noFailure ? "PASS" : "FAIL", noStall ? "PASS" : "FAIL",
       !judged ? "n/a"
       : flat  ? "PASS"
               : "FAIL",
-      allProcessed ? "PASS" : "FAIL");
-  return rateHeld && noFailure && noStall && flat && allProcessed && !feeder.failed() ? 0 : 1;
+      allProcessed ? "PASS" : "FAIL",
+      options.alertEvery == 0 ? "n/a"
+      : alertPace             ? "PASS"
+                              : "FAIL");
+  return rateHeld && noFailure && noStall && flat && allProcessed && alertPace && !feeder.failed()
+             ? 0
+             : 1;
 }

@@ -7,6 +7,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cctype>
 #include <chrono>
 #include <cstring>
 #include <filesystem>
@@ -130,6 +131,14 @@ bool AgentHome::Stop() {
 
 std::string AgentHome::Trace() const {
   return q7test::readFile(home_ + "logs/q7agent.log");
+}
+
+std::string AgentHome::ApiToken() const {
+  std::string token = q7test::readFile(home_ + "config/q7_api_token");
+  while (!token.empty() && std::isspace(static_cast<unsigned char>(token.back()))) {
+    token.pop_back();
+  }
+  return token;
 }
 
 nlohmann::json Sample(const std::string& address, const std::string& table,

@@ -54,6 +54,8 @@ class AgentHome {
   bool Stop();
   // The agent's trace file (errors only, by default).
   std::string Trace() const;
+  // The bearer token changes over the API need (created by the agent at its first start).
+  std::string ApiToken() const;
 
  private:
   const std::string home_;  // with a trailing '/'
