@@ -250,22 +250,27 @@ TEST(WebhookSenderTest, RefusesWithoutBlockingWhenFull) {
   EXPECT_TRUE(sender.Enqueue(dead.url(), "{\"n\":2}"));
 
   const auto start = std::chrono::steady_clock::now();
-  EXPECT_FALSE(sender.Enqueue(dead.url(), "{\"n\":3}"));
+  for (int n = 3; n <= 52; ++n) {
+    EXPECT_FALSE(sender.Enqueue(dead.url(), "{\"n\":" + std::to_string(n) + "}"));
+  }
   EXPECT_LT(std::chrono::steady_clock::now() - start, 100ms);
+  EXPECT_FALSE(sender.Enqueue("ftp://example.com/", "{}"));
   EXPECT_FALSE(sender.Enqueue("ftp://example.com/", "{}"));
 
   WebhookSender::Counters counters = sender.counters();
   EXPECT_EQ(2u, counters.enqueued);
-  EXPECT_EQ(1u, counters.dropped_full);
-  EXPECT_EQ(1u, counters.dropped_invalid);
+  EXPECT_EQ(50u, counters.dropped_full);
+  EXPECT_EQ(2u, counters.dropped_invalid);
   EXPECT_EQ(2u, counters.pending);
-  EXPECT_EQ(1, trace.count("2 deliveries are pending already"));
+  // Each kind traced once within the period, not once a refusal.
+  EXPECT_EQ(1, trace.count("dropped (1 so far): 2 deliveries are pending already"));
+  EXPECT_EQ(2, trace.count(" so far): "));
 
   sender.Stop();
   EXPECT_FALSE(sender.Enqueue(dead.url(), "{}"));
   counters = sender.counters();
   EXPECT_EQ(2u, counters.enqueued);
-  EXPECT_EQ(1u, counters.dropped_full);
+  EXPECT_EQ(50u, counters.dropped_full);
 }
 
 // Stop does not wait out a backoff.
