@@ -3,7 +3,6 @@
 
 #include <httplib.h>
 
-#include <atomic>
 #include <cstdio>
 #include <ctime>
 #include <fstream>
@@ -37,9 +36,8 @@ class Receiver {
       }
       if (mode == Mode::kHang) {
         // Longer than the agent's 5 s timeout; the test's end releases it.
-        for (int i = 0; i < 80 && !released_.load(); ++i) {
-          std::this_thread::sleep_for(100ms);
-        }
+        fw::MutexLock lock(mutex_);
+        released_cv_.WaitFor(mutex_, 8s, [this]() REQUIRES(mutex_) { return released_; });
       }
       res.status = mode == Mode::kOk ? 204 : 500;
     });
@@ -48,7 +46,11 @@ class Receiver {
     waitFor([this] { return server_.is_running(); }, 5s);
   }
   ~Receiver() {
-    released_ = true;
+    {
+      fw::MutexLock lock(mutex_);
+      released_ = true;
+    }
+    released_cv_.NotifyAll();
     server_.stop();
     thread_.join();
   }
@@ -70,8 +72,9 @@ class Receiver {
   httplib::Server server_;
   int port_ = 0;
   std::thread thread_;
-  std::atomic<bool> released_{false};
   fw::Mutex mutex_;
+  fw::CondVar released_cv_;  // signalled when the test ends and hanging POSTs may answer
+  bool released_ GUARDED_BY(mutex_) = false;
   Mode mode_ GUARDED_BY(mutex_) = Mode::kOk;
   std::vector<nlohmann::json> bodies_ GUARDED_BY(mutex_);
   int attempts_ GUARDED_BY(mutex_) = 0;
