@@ -222,16 +222,16 @@ void AlertSampler::Publish(const std::vector<AlertChange>& changes, const std::s
     counters_.changes += changes.size();
   }
   for (const AlertChange& change : changes) {
-    PushEventJson(kAlertEventStream, change.ToJson());
+    nlohmann::ordered_json json = change.ToJson();
     Q7_TRACE(
         kUnit, kTraceSummary, "situation %s: %s %s", change.situation.c_str(),
         std::string(AlertKindName(change.kind)).c_str(),
         change.key.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace).c_str());
     if (!webhook.empty() && webhooks_ != nullptr) {
       webhooks_->Enqueue(
-          webhook,
-          change.ToJson().dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace));
+          webhook, json.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace));
     }
+    PushEventJson(kAlertEventStream, std::move(json));
   }
 }
 
